@@ -1,0 +1,25 @@
+// Starting other programs.
+#pragma once
+
+#include <sys/types.h>
+
+// Starts the executable `path` (a full path: PATH is not searched) with the null-terminated vectors
+// `argv` and `envp` (null: no environment). The three descriptors become 0, 1 and 2 of the child,
+// which also inherits everything else that is not marked close-on-exec; the caller keeps its own.
+// With `trace_me` the child becomes a ptrace tracee of the caller and stops with SIGTRAP at its
+// successful execve.
+//
+// Returns the child's pid, which the caller must reap, or -1 with "fork: ..." printed on standard
+// error. A program that cannot be executed is not a failure here: the child prints "execve: ..." on
+// `err_fd` and exits with 1.
+pid_t spawn_process(const char *path, char *const argv[], char *const envp[], int in_fd, int out_fd,
+                    int err_fd, bool trace_me);
+
+// The same with an empty environment, as nearly everything is started.
+pid_t spawn_process_noenv(const char *path, char *const argv[], int in_fd, int out_fd, int err_fd,
+                          bool trace_me);
+
+// Starts `path` with an empty environment, waits for its end and returns bits 8 to 15 of its wait
+// status: the exit code, or 0 for a child that a signal killed. Also 0 when the wait fails.
+int run_process_wait(const char *path, char *const argv[], int in_fd, int out_fd, int err_fd,
+                     bool trace_me);
