@@ -28,7 +28,8 @@ int run_ctest(int, char **) {
 }
 
 int run_segfault(int, char **) {
-    // Volatile twice over, so that the compiler neither drops the store nor puts its own trap there.
+    // Volatile twice over, so that the compiler neither drops the store nor puts its own trap
+    // there.
     volatile int *volatile null_pointer = nullptr;
     *null_pointer = 0;
     __builtin_trap();

@@ -5,21 +5,25 @@
 #include <string>
 
 struct SandboxOptions {
-    bool eth0 = false;    // a network interface "eth0" (10.99.0.1/24), its other end is "eth1"
-    int timeout_s = 90;   // then everything in it is killed, and the test fails
+    bool eth0 = false;   // a network interface "eth0" (10.99.0.1/24), its other end is "eth1"
+    int timeout_s = 90;  // then everything in it is killed, and the test fails
 };
 
-// Runs `body` in a child process inside new pid, mount, network and IPC namespaces, with a /proc of
-// its own, loopback up, and a private writable copy-on-write-free /tmp and /run. `body` makes
-// GoogleTest assertions as usual; the test fails when any of them does. Everything that is started
-// in there ends with it. Must not be used from a test that has threads.
+// Runs `body` in a child process inside new pid, mount, network and IPC namespaces (and a user
+// namespace when not root), with a /proc of its own and loopback up. `body` makes GoogleTest
+// assertions as usual; the test fails when any of them does. Everything that is started in there
+// ends with it. For the whole body of a test, which must not have threads.
 //
 // On machines that refuse namespaces the test is skipped, with the kernel's reason.
 void run_in_sandbox(const std::function<void()> &body, const SandboxOptions &options = {});
 
-// Only inside a sandbox: makes `path`, a file or directory, appear as `source` there, by a bind
-// mount. A missing `path` is made below a writable overlay of its parent directory.
+// Only inside a sandbox: makes `path`, a file or directory, appear as `source`, by a bind mount. A
+// `path` that does not exist is made in a scratch layer over the nearest directory that does.
 void sandbox_bind(const std::string &source, const std::string &path);
+
+// Only inside a sandbox: makes the existing directory `path` writable without a trace outside: a
+// scratch layer over it that ends with the sandbox.
+void sandbox_scratch(const std::string &path);
 
 // Only inside a sandbox: runs a shell command, which must succeed.
 void sandbox_shell(const std::string &command);
