@@ -1,1 +1,223 @@
-// (to come)
+#include "proc/process_table.h"
+
+#include <ctype.h>
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "util/unique_fd.h"
+
+namespace {
+
+constexpr size_t PATH_SIZE = 128;
+constexpr size_t STAT_SIZE = 256;
+constexpr size_t NAME_SIZE = 1024;
+
+pid_t ignore_pid = -1;
+
+void format_proc_path(char (&path)[PATH_SIZE], const char *root, pid_t pid, const char *file) {
+    (void)snprintf(path, sizeof path, "%s/%ld/%s", root, static_cast<long>(pid), file);
+}
+
+// Reads a file of process `pid` into `buf` as a terminated text, cut to `len` - 1 bytes. False when
+// there is nothing to read.
+bool read_proc_text(const char *root, pid_t pid, const char *file, char *buf, size_t len) {
+    char path[PATH_SIZE];
+    struct stat status;
+    format_proc_path(path, root, pid, file);
+    if (stat(path, &status) != 0)
+        return false;
+    ssize_t n = read_file(path, buf, len);
+    if (n < 1)
+        return false;
+    size_t length = static_cast<size_t>(n);
+    buf[length < len ? length : len - 1] = '\0';
+    return true;
+}
+
+// Moves what `name` points to inside `buf` to its start.
+void move_to_start(char *buf, const char *name) {
+    memmove(buf, name, strlen(name) + 1);
+}
+
+struct DescriptorCounts {
+    int all = 0;
+    int sockets = 0;
+    int pipes = 0;
+};
+
+void count_target(const char *target, DescriptorCounts *counts) {
+    if (strncmp(target, "socket:[", 8) == 0)
+        ++counts->sockets;
+    // A comparison of the whole target, which always has a number behind the bracket: pipes are not
+    // counted, and the scores that are built on these counts are balanced for that.
+    else if (strcmp(target, "pipe:[") == 0)
+        ++counts->pipes;
+}
+
+// Counts the descriptors in `dir` from where it stands. Returns false when a link could not be
+// read, because the descriptor was closed meanwhile.
+bool count_entries(DIR *dir, bool read_links, DescriptorCounts *counts) {
+    while (const dirent *entry = readdir(dir)) {
+        if (entry->d_name[0] == '.')
+            continue;
+        ++counts->all;
+        if (!read_links)
+            continue;
+        char target[128];
+        ssize_t n = readlinkat(dirfd(dir), entry->d_name, target, sizeof target - 1);
+        if (n < 0)
+            return false;
+        target[n] = '\0';
+        count_target(target, counts);
+    }
+    return true;
+}
+
+}  // namespace
+
+ssize_t read_file(const char *path, char *buf, size_t len) {
+    UniqueFd fd(open(path, O_RDONLY | O_CLOEXEC));
+    return fd.valid() ? read(fd.get(), buf, len) : -1;
+}
+
+bool name_from_cmdline(char *text) {
+    const char *slash = strrchr(text, '/');
+    if (slash == nullptr || slash[1] == '\0')
+        return false;
+    move_to_start(text, slash + 1);
+    return true;
+}
+
+bool name_from_stat(char *text) {
+    char *close = strrchr(text, ')');
+    if (close == nullptr || close[1] != ' ')
+        return false;
+    *close = '\0';
+    const char *open = strrchr(text, '(');
+    if (open == nullptr || open[1] == '\0')
+        return false;
+    move_to_start(text, open + 1);
+    return true;
+}
+
+pid_t ppid_from_stat(const char *text) {
+    for (int field = 1; field < 4; ++field) {
+        while (*text != '\0' && !isspace(static_cast<unsigned char>(*text)))
+            ++text;
+        while (isspace(static_cast<unsigned char>(*text)))
+            ++text;
+    }
+    return *text != '\0' ? static_cast<pid_t>(strtol(text, nullptr, 10)) : -1;
+}
+
+int proc_name(const char *root, pid_t pid, char *buf, size_t len) {
+    if (read_proc_text(root, pid, "cmdline", buf, len) && name_from_cmdline(buf))
+        return 1;
+    return read_proc_text(root, pid, "stat", buf, len) && name_from_stat(buf);
+}
+
+int pid_name(pid_t pid, char *buf, size_t len) {
+    return proc_name("/proc", pid, buf, len);
+}
+
+void set_ignore_pid(pid_t pid) {
+    ignore_pid = pid;
+}
+
+int list_pids(pid_t *pids, int capacity, pid_t exclude_pid) {
+    UniqueDir dir(opendir("/proc/"));
+    if (dir == nullptr)
+        return 0;
+    pid_t self = getpid();
+    pid_t parent = getppid();
+    int count = 0;
+    while (const dirent *entry = readdir(dir.get())) {
+        pid_t pid = static_cast<pid_t>(strtol(entry->d_name, nullptr, 10));
+        if (pid == 0 && entry->d_name[0] != '0')
+            continue;
+        if (pid == 1 || pid == exclude_pid || pid == ignore_pid || pid == self || pid == parent)
+            continue;
+        if (count < capacity)
+            pids[count++] = pid;
+    }
+    return count;
+}
+
+void drop_pid(pid_t *pids, int first, int end, pid_t pid) {
+    for (int i = first; i < end; ++i) {
+        if (pids[i] == pid) {
+            pids[i] = -1;
+            return;
+        }
+    }
+}
+
+ssize_t exe_link(pid_t pid, char *buf, size_t size) {
+    char path[PATH_SIZE];
+    format_proc_path(path, "/proc", pid, "exe");
+    ssize_t n = readlink(path, buf, size - 1);
+    if (n == static_cast<ssize_t>(size - 1))
+        buf[n] = '\0';
+    return n;
+}
+
+int is_kernel_thread(pid_t pid) {
+    char link[2];
+    return exe_link(pid, link, sizeof link) == -1;
+}
+
+pid_t proc_ppid(pid_t pid) {
+    char path[PATH_SIZE];
+    char text[STAT_SIZE + 1];
+    format_proc_path(path, "/proc", pid, "stat");
+    ssize_t n = read_file(path, text, STAT_SIZE);
+    if (n < 1)
+        return -1;
+    text[n] = '\0';
+    return ppid_from_stat(text);
+}
+
+void find_pids_by_name(const char *root, const char *name, pid_t *pids, int *count, int capacity) {
+    *count = 0;
+    UniqueDir dir(opendir(root));
+    if (dir == nullptr)
+        return;
+    while (*count < capacity) {
+        const dirent *entry = readdir(dir.get());
+        if (entry == nullptr)
+            return;
+        if (!isdigit(static_cast<unsigned char>(entry->d_name[0])))
+            continue;
+        pid_t pid = static_cast<pid_t>(strtol(entry->d_name, nullptr, 10));
+        char found[NAME_SIZE];
+        if (proc_name(root, pid, found, sizeof found) == 1 && strcmp(found, name) == 0)
+            pids[(*count)++] = pid;
+    }
+}
+
+int count_fds(pid_t pid, int *sockets, int *pipes) {
+    char path[PATH_SIZE];
+    format_proc_path(path, "/proc", pid, "fd");
+    bool read_links = sockets != nullptr || pipes != nullptr;
+    DescriptorCounts counts;
+    bool complete;
+    do {
+        UniqueDir dir(opendir(path));
+        if (dir == nullptr) {
+            counts = {};
+            break;
+        }
+        // Begun again, what had been counted so far stays: a table that changes so fast is busy,
+        // and an estimate on the high side draws the eye to it.
+        complete = count_entries(dir.get(), read_links, &counts);
+    } while (!complete);
+    if (sockets != nullptr)
+        *sockets = counts.sockets;
+    if (pipes != nullptr)
+        *pipes = counts.pipes;
+    return counts.all;
+}

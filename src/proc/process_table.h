@@ -52,3 +52,17 @@ void find_pids_by_name(const char *root, const char *name, pid_t *pids, int *cou
 // Returns the number of open descriptors of `pid`, and stores in `sockets` and `pipes`, either of
 // which may be null, how many of them are sockets and pipes. All are 0 when they cannot be listed.
 int count_fds(pid_t pid, int *sockets, int *pipes);
+
+// The parsing behind them, on terminated texts.
+
+// Reduces `text`, the contents of a cmdline file, to the last path component of argument 0. False
+// when that holds no "/" or ends in one; `text` is then as it was.
+bool name_from_cmdline(char *text);
+
+// Reduces `text`, the contents of a stat file, to the command name: what follows the last "("
+// before the last ")", behind which a blank must stand. False when there is none.
+bool name_from_stat(char *text);
+
+// The fourth of the blank-separated fields of a stat file, or -1 when there are fewer. The fields
+// are counted without regard to parentheses, so a command name with blanks in it shifts them.
+pid_t ppid_from_stat(const char *text);

@@ -1,0 +1,331 @@
+#include "proc/process_table.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+
+#include <algorithm>
+#include <atomic>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "support/run_program.h"
+#include "support/sandbox.h"
+#include "support/temp_dir.h"
+
+namespace {
+
+int ready_fd;  // in a Child that is setting up: the pipe to its parent, closed afterwards
+
+// A child process that runs `set_up` and then waits to be killed.
+class Child {
+  public:
+    explicit Child(const std::function<void()> &set_up = [] {}) {
+        int ready[2];
+        EXPECT_EQ(0, pipe(ready));
+        pid_ = fork();
+        if (pid_ == 0) {
+            close(ready[0]);
+            ready_fd = ready[1];
+            set_up();
+            (void)!write(ready[1], "x", 1);
+            close(ready[1]);
+            for (;;)
+                pause();
+        }
+        close(ready[1]);
+        char byte;
+        EXPECT_EQ(1, read(ready[0], &byte, 1));
+        close(ready[0]);
+    }
+    ~Child() {
+        kill(pid_, SIGKILL);
+        waitpid(pid_, nullptr, 0);
+    }
+    pid_t pid() const { return pid_; }
+
+  private:
+    pid_t pid_;
+};
+
+std::string from_cmdline(std::string text) {
+    text.push_back('\0');
+    return name_from_cmdline(text.data()) ? text.data() : "(none)";
+}
+
+std::string from_stat(std::string text) {
+    text.push_back('\0');
+    return name_from_stat(text.data()) ? text.data() : "(none)";
+}
+
+// A made-up /proc directory.
+struct FakeProc {
+    TempDir dir;
+    void process(pid_t pid, const std::string &cmdline, const std::string &stat) {
+        dir.file(std::to_string(pid) + "/cmdline", cmdline);
+        dir.file(std::to_string(pid) + "/stat", stat);
+    }
+    std::string name(pid_t pid, size_t size = 128) const {
+        std::string buf(size, '#');
+        return proc_name(dir.path().c_str(), pid, buf.data(), size) == 1 ? buf.c_str() : "(none)";
+    }
+};
+
+const std::string NUL(1, '\0');
+
+// What list_pids gives, in order.
+std::vector<pid_t> sorted_pids(pid_t exclude) {
+    std::vector<pid_t> pids(100);
+    pids.resize(static_cast<size_t>(list_pids(pids.data(), 100, exclude)));
+    std::sort(pids.begin(), pids.end());
+    return pids;
+}
+
+TEST(ReadFile, MakesOneReadOfAtMostTheLength) {
+    TempDir dir;
+    std::string path = dir.file("ten", "0123456789");
+    char buf[20] = "####";
+    EXPECT_EQ(4, read_file(path.c_str(), buf, 4));
+    EXPECT_EQ("0123", std::string(buf, 4));
+    EXPECT_EQ(10, read_file(path.c_str(), buf, sizeof buf));
+    EXPECT_EQ(-1, read_file((dir / "none").c_str(), buf, sizeof buf));
+    EXPECT_EQ(-1, read_file("/", buf, sizeof buf));
+}
+
+TEST(ProcName, IsTheLastPathComponentOfArgumentZero) {
+    EXPECT_EQ("app", from_cmdline("/usr/bin/app" + NUL + "-x" + NUL + "/etc/file"));
+    EXPECT_EQ("app", from_cmdline("./app"));
+    EXPECT_EQ("(none)", from_cmdline("app" + NUL + "/usr"));
+    EXPECT_EQ("(none)", from_cmdline("/usr/bin/"));
+    EXPECT_EQ("(none)", from_cmdline(""));
+}
+
+TEST(ProcName, IsTheCommandNameOfTheStatFileOtherwise) {
+    EXPECT_EQ("app", from_stat("12 (app) S 1 12 12"));
+    EXPECT_EQ("two words", from_stat("12 (two words) S 1"));
+    EXPECT_EQ("(none)", from_stat("12 () S 1"));
+    EXPECT_EQ("(none)", from_stat("12 (app)"));
+    EXPECT_EQ("(none)", from_stat("12 app S 1"));
+    EXPECT_EQ("(none)", from_stat("12 app) S 1"));
+    EXPECT_EQ("(none)", from_stat(""));
+}
+
+TEST(ProcName, OfAStatNameWithParenthesesInItIsCutAtTheLastOnes) {
+    EXPECT_EQ("b", from_stat("12 (a) (b) S 1"));
+    EXPECT_EQ("(none)", from_stat("12 (a)b)x S 1"));
+}
+
+TEST(ProcName, SurvivesAStatFileCutAtEveryLength) {
+    std::string text = "12 (app) S 1";
+    for (size_t length = 0; length <= text.size(); ++length)
+        EXPECT_EQ(length >= 9 ? "app" : "(none)", from_stat(text.substr(0, length))) << length;
+}
+
+TEST(ProcName, OfAProcessStartedWithAPathIsItsLastComponentAndOfABareNameComesFromStat) {
+    FakeProc proc;
+    proc.process(10, "/usr/bin/app" + NUL + "-v" + NUL, "10 (other) S 1");
+    proc.process(11, "app" + NUL, "11 (statname) S 1");
+    proc.process(12, "", "12 (kthread) S 1");
+    proc.process(13, "", "");
+    EXPECT_EQ("app", proc.name(10));
+    EXPECT_EQ("statname", proc.name(11));
+    EXPECT_EQ("kthread", proc.name(12));
+    EXPECT_EQ("(none)", proc.name(13));
+    EXPECT_EQ("(none)", proc.name(14));
+}
+
+TEST(ProcName, DoesNotReadWhatTheBufferHeldBefore) {
+    FakeProc proc;
+    proc.process(10, "app) (stale) x" + std::string(100, 'y'), "10 (app) S 1");
+    EXPECT_EQ("app", proc.name(10, 256));
+}
+
+TEST(ProcName, FitsEveryBufferOfTwoBytesOrMore) {
+    FakeProc proc;
+    proc.process(10, "/bin/longname" + NUL, "10 (statname) S 1");
+    for (size_t size = 2; size < 20; ++size) {
+        std::string name = proc.name(10, size);
+        EXPECT_LT(name.size(), std::max<size_t>(size, 7)) << name;
+    }
+    EXPECT_EQ("lo", proc.name(10, 8));
+}
+
+TEST(PidName, TellsOurOwnName) {
+    char buf[128];
+    ASSERT_EQ(1, pid_name(getpid(), buf, sizeof buf));
+    EXPECT_STREQ("unit_proc", buf);
+    EXPECT_EQ(0, pid_name(0x7fffffff, buf, sizeof buf));
+}
+
+TEST(ListPids, LeavesOutInitTheCallerItsParentAndThoseNamed) {
+    run_in_sandbox([] {
+        // Below init, which is 1: 2 is the body, and the list is made by a child of it.
+        Child first;
+        Child second;
+        Child third;
+        pid_t lister = fork();
+        if (lister == 0) {
+            std::vector<pid_t> all = {first.pid(), second.pid(), third.pid()};
+            EXPECT_EQ(all, sorted_pids(-1));
+            EXPECT_EQ((std::vector<pid_t>{first.pid(), third.pid()}), sorted_pids(second.pid()));
+            set_ignore_pid(third.pid());
+            EXPECT_EQ((std::vector<pid_t>{first.pid()}), sorted_pids(second.pid()));
+            set_ignore_pid(-1);
+            EXPECT_EQ(all, sorted_pids(-1));
+            _exit(testing::Test::HasFailure());
+        }
+        int status;
+        waitpid(lister, &status, 0);
+        EXPECT_EQ(0, status);
+    });
+}
+
+TEST(ListPids, FillsAFullArrayToExactlyItsCapacity) {
+    run_in_sandbox([] {
+        Child children[5];
+        pid_t pids[4] = {-7, -7, -7, -7};
+        EXPECT_EQ(3, list_pids(pids, 3, -1));
+        EXPECT_GT(pids[2], 0);
+        EXPECT_EQ(-7, pids[3]);
+        EXPECT_EQ(0, list_pids(pids, 0, -1));
+    });
+}
+
+TEST(ListPids, ListsADirectoryEntryZeroAndNoneThatIsNotANumber) {
+    run_in_sandbox([] {
+        TempDir fake;
+        for (const char *name : {"0/x", "1/x", "self/x", "sys/x", "77/x"})
+            fake.file(name, "");
+        sandbox_bind(fake.path(), "/proc");
+        EXPECT_EQ((std::vector<pid_t>{0, 77}), sorted_pids(-1));
+    });
+}
+
+TEST(ListPids, GivesNothingWithoutProc) {
+    run_in_sandbox([] {
+        TempDir empty;
+        sandbox_bind(empty.path(), "/proc");
+        pid_t pids[10];
+        EXPECT_EQ(0, list_pids(pids, 10, -1));
+    });
+}
+
+TEST(DropPid, ReplacesTheFirstMatchInTheRange) {
+    pid_t pids[] = {5, 6, 5, 5};
+    drop_pid(pids, 1, 4, 5);
+    EXPECT_EQ((std::vector<pid_t>{5, 6, -1, 5}), std::vector<pid_t>(pids, pids + 4));
+    drop_pid(pids, 0, 4, 9);
+    drop_pid(pids, 3, 3, 5);
+    EXPECT_EQ((std::vector<pid_t>{5, 6, -1, 5}), std::vector<pid_t>(pids, pids + 4));
+}
+
+TEST(ExeLink, IsTerminatedOnlyWhenItIsCut) {
+    char whole[4096];
+    ssize_t length = exe_link(getpid(), whole, sizeof whole);
+    ASSERT_GT(length, 4);
+    char buf[4096];
+    memset(buf, '#', sizeof buf);
+    EXPECT_EQ(3, exe_link(getpid(), buf, 4));
+    EXPECT_EQ(std::string(whole, 3), buf);
+    memset(buf, '#', sizeof buf);
+    EXPECT_EQ(length, exe_link(getpid(), buf, sizeof buf));
+    EXPECT_EQ('#', buf[length]);
+    EXPECT_EQ(-1, exe_link(0x7fffffff, buf, sizeof buf));
+}
+
+TEST(IsKernelThread, SaysYesOnlyOfProcessesWithoutAnExecutable) {
+    EXPECT_EQ(0, is_kernel_thread(getpid()));
+    EXPECT_EQ(1, is_kernel_thread(0x7fffffff));
+}
+
+TEST(ProcPpid, TellsTheParent) {
+    Child child;
+    EXPECT_EQ(getpid(), proc_ppid(child.pid()));
+    EXPECT_EQ(-1, proc_ppid(0x7fffffff));
+}
+
+TEST(ProcPpid, IsAnotherFieldForACommandNameWithABlankInIt) {
+    EXPECT_EQ(77, ppid_from_stat("12 (app) S 77 12 13"));
+    EXPECT_EQ(0, ppid_from_stat("12 (my app) S 77 12 13"));
+    EXPECT_EQ(5, ppid_from_stat("12 (a b) 5 77 9"));
+    Child child([] { prctl(PR_SET_NAME, "a b"); });
+    EXPECT_EQ(0, proc_ppid(child.pid()));
+}
+
+TEST(ProcPpid, NeedsFourFields) {
+    std::string text = "12 (app) S 77";
+    for (size_t length = 0; length < text.size() - 2; ++length)
+        EXPECT_EQ(-1, ppid_from_stat(text.substr(0, length).c_str())) << length;
+    EXPECT_EQ(7, ppid_from_stat("12 (app) S 7"));
+    EXPECT_EQ(77, ppid_from_stat("12\t(app)\n\nS  77"));
+}
+
+TEST(FindPidsByName, ComparesExactlyAndStopsAtTheCapacity) {
+    FakeProc proc;
+    proc.process(10, "/usr/bin/app" + NUL, "10 (app) S 1");
+    proc.process(11, "", "11 (app) S 1");
+    proc.process(12, "/usr/bin/App" + NUL, "12 (App) S 1");
+    proc.process(13, "/usr/bin/apps" + NUL, "13 (apps) S 1");
+    proc.dir.file("x14/cmdline", "/usr/bin/app" + NUL);
+    pid_t pids[10];
+    int count = -1;
+    find_pids_by_name(proc.dir.path().c_str(), "app", pids, &count, 10);
+    ASSERT_EQ(2, count);
+    std::sort(pids, pids + 2);
+    EXPECT_EQ(10, pids[0]);
+    EXPECT_EQ(11, pids[1]);
+    find_pids_by_name(proc.dir.path().c_str(), "app", pids, &count, 1);
+    EXPECT_EQ(1, count);
+    find_pids_by_name((proc.dir / "none").c_str(), "app", pids, &count, 10);
+    EXPECT_EQ(0, count);
+}
+
+TEST(CountFds, OfThreeSocketsAndTwoPipesGivesThreeSocketsAndNoPipes) {
+    Child child([] {
+        for (int fd = 0; fd < 1000; ++fd) {
+            if (fd != ready_fd)
+                close(fd);
+        }
+        int ends[2];
+        (void)!pipe(ends);
+        for (int i = 0; i < 3; ++i)
+            (void)socket(AF_INET, SOCK_DGRAM, 0);
+    });
+    // The pipe that tells us of its being ready is closed a moment later.
+    ASSERT_TRUE(wait_until([&] { return count_fds(child.pid(), nullptr, nullptr) == 5; }));
+    int sockets = -1, pipes = -1;
+    EXPECT_EQ(5, count_fds(child.pid(), &sockets, &pipes));
+    EXPECT_EQ(3, sockets);
+    EXPECT_EQ(0, pipes);
+    EXPECT_EQ(5, count_fds(child.pid(), nullptr, nullptr));
+}
+
+TEST(CountFds, OfAProcessThatHasGoneIsZeroThroughout) {
+    int sockets = 7, pipes = 7;
+    EXPECT_EQ(0, count_fds(0x7fffffff, &sockets, &pipes));
+    EXPECT_EQ(0, sockets);
+    EXPECT_EQ(0, pipes);
+}
+
+TEST(CountFds, SurvivesDescriptorsThatComeAndGo) {
+    std::atomic<bool> stop = false;
+    std::thread churn([&] {
+        while (!stop) {
+            int fd = open("/dev/null", O_RDONLY);
+            close(fd);
+        }
+    });
+    for (int i = 0; i < 200; ++i) {
+        int sockets, pipes;
+        EXPECT_GE(count_fds(getpid(), &sockets, &pipes), 3);
+    }
+    stop = true;
+    churn.join();
+}
+
+}  // namespace
