@@ -1,5 +1,5 @@
-// What goes into an archive about the system as a whole: the kernel's memory image, the output of
-// programs, a packet capture and a system-call trace.
+// What goes into an archive about the system as a whole: the kernel's memory image, a packet
+// capture and a system-call trace.
 //
 // The collectors return 0 to let the archive go on or 1 when its output is broken; a source that
 // cannot be read costs its own member only.
@@ -12,11 +12,6 @@
 
 // Adds "kcore", unless it is empty or larger than 10 MiB.
 int add_kcore(TarWriter *tw, int fd);
-
-// Runs `argv` with output and errors into an unlinked temporary file made from the mkstemp template
-// `name_template` (which is changed), and adds that as `member`.
-int add_command_output(TarWriter *tw, int fd, const char *member, char *const argv[],
-                       char *name_template);
 
 // Captures on `interface` for `duration` seconds into the member "netdump.cap" of exactly `size`
 // bytes or, when `tw` is null, into `size` bytes of plain output. When `fd` is a connected socket

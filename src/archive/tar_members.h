@@ -1,4 +1,4 @@
-// Adds files of the file system to a tar stream.
+// Adds files of the file system, and the output of programs, to a tar stream.
 #pragma once
 
 #include <stdint.h>
@@ -7,8 +7,8 @@
 
 constexpr uint32_t SMALL_FILE_LIMIT = 102400;  // bytes kept of a file that is read whole
 
-// Adds the file `path` as member `name` with the size that fstat tells, copied straight to `fd`, the
-// writer's descriptor. A file that shrinks meanwhile is filled up with zeros; one that grows is
+// Adds the file `path` as member `name` with the size that fstat tells, copied straight to `fd`,
+// the writer's descriptor. A file that shrinks meanwhile is filled up with zeros; one that grows is
 // copied to its end all the same. Returns 0, also when the file cannot be opened (no member), or 1
 // when the output is broken.
 int tar_add_file(TarWriter *tw, int fd, const char *name, const char *path);
@@ -23,3 +23,9 @@ int tar_add_open_file(TarWriter *tw, int fd, const char *name, int source, int64
 // that cannot be read adds nothing and is named on standard error. Returns 0, or 1 when memory is
 // short; output errors are not told.
 int tar_add_small_file(TarWriter *tw, int fd, const char *name, const char *path, uint32_t limit);
+
+// Runs `argv` with output and errors into an unlinked temporary file made from the mkstemp template
+// `name_template` (which is changed), and adds that as `member`. Returns 0,
+// also when there is no temporary file (no member), or 1 when the output is broken.
+int add_command_output(TarWriter *tw, int fd, const char *member, char *const argv[],
+                       char *name_template);

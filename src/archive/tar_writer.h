@@ -8,7 +8,7 @@
 // must write exactly that much data behind it, through tar_write, or straight to the descriptor
 // with tar_account.
 struct TarWriter {
-    char *prefix;           // our own copy, in front of every member name; null for none
+    char *prefix;  // our own copy, in front of every member name; null for none
     uint32_t prefix_len;
     int32_t fd;             // borrowed
     uint32_t member_bytes;  // data of the current member so far; the padding follows from it
@@ -21,10 +21,13 @@ TarWriter *tar_open(int fd, const char *prefix);
 // Pads the last member and frees the writer.
 void tar_close(TarWriter *tw);
 
+// Frees the writer of an archive whose output is broken: nothing more is written.
+void tar_abandon(TarWriter *tw);
+
 // Pads the previous member and writes the header of member `name` with `size` bytes of data. A name
 // that does not fit the header's 100 bytes together with the prefix is cut. Write errors are not
 // told; they show in the data that follows.
-void tar_header(TarWriter *tw, const char *name, int32_t size);
+void tar_header(TarWriter *tw, const char *name, int64_t size);
 
 // Writes data of the current member. Returns what write_all returns.
 int32_t tar_write(TarWriter *tw, const void *buf, uint32_t len);

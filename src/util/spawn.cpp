@@ -1,5 +1,6 @@
 #include "util/spawn.h"
 
+#include <errno.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/ptrace.h>
@@ -50,7 +51,16 @@ int run_process_wait(const char *path, char *const argv[], int in_fd, int out_fd
                      bool trace_me) {
     int status = 1;
     pid_t pid = spawn_process(path, argv, nullptr, in_fd, out_fd, err_fd, trace_me);
-    if (pid != -1)
-        (void)waitpid(pid, &status, 0);
+    (void)wait_for_child(pid, &status);
     return (status >> 8) & 0xff;
+}
+
+pid_t wait_for_child(pid_t pid, int *status) {
+    if (pid == -1)
+        return -1;  // to waitpid that would be any child
+    pid_t waited;
+    do {
+        waited = waitpid(pid, status, 0);
+    } while (waited == -1 && errno == EINTR);
+    return waited;
 }

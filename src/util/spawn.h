@@ -23,3 +23,7 @@ pid_t spawn_process_noenv(const char *path, char *const argv[], int in_fd, int o
 // status: the exit code, or 0 for a child that a signal killed. Also 0 when the wait fails.
 int run_process_wait(const char *path, char *const argv[], int in_fd, int out_fd, int err_fd,
                      bool trace_me);
+
+// Waits for the end of the child `pid`, resuming after signals. Returns what waitpid does: `pid`
+// with the wait status in `status` (which may be null), or -1, also for a `pid` of -1.
+pid_t wait_for_child(pid_t pid, int *status);
