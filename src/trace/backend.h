@@ -18,12 +18,12 @@ struct TraceRegisters {
 // One system-call stop, as the formatter sees it. Words are the tracee's, zero-extended when they
 // are shorter than an unsigned long.
 struct SyscallRecord {
-    unsigned long pc;        // program counter
-    unsigned long ra;        // return address
-    unsigned long number;    // of the call, as at its entry
-    unsigned long arg[6];    // the fifth and sixth are read afresh at the exit
-    unsigned long result;    // at entry: the number again
-    uint32_t writeback;      // set by a formatter that changed arguments: put them back
+    unsigned long pc = 0;       // program counter
+    unsigned long ra = 0;       // return address
+    unsigned long number = 0;   // of the call, as at its entry
+    unsigned long arg[6] = {};  // the fifth and sixth are read afresh at the exit
+    unsigned long result = 0;   // at entry: the number again
+    uint32_t writeback = 0;     // set by a formatter that changed arguments: put them back
 };
 
 // What the tracer asks of the machine. `pid` is a tracee of the calling thread, and stopped. The
@@ -41,7 +41,8 @@ struct TraceBackend {
     // stack words, which are read now.
     void (*exit_record)(pid_t pid, const TraceRegisters &regs, SyscallRecord *record);
 
-    // Puts the arguments and, at an exit, the result of `record` back into the tracee.
+    // Puts the arguments and the result of `record` back into the tracee. At an entry the result
+    // stands for the call's number.
     void (*write_back)(pid_t pid, const TraceRegisters &regs, const SyscallRecord &record,
                        bool at_entry);
 

@@ -17,3 +17,9 @@ int syscall_entry_stop(TraceRequest *request, pid_t pid, SyscallRecord *record, 
 // Returns as above, -1 for a number out of range.
 int syscall_exit_stop(TraceRequest *request, pid_t pid, SyscallRecord *record, char *buf,
                       size_t size, TraceRegisters *regs, unsigned long *exit_record);
+
+// Puts the arguments and the result of `record` back into `pid`, a tracee at an exit stop whose
+// entry registers are `regs`, and clears its writeback flag; says so on standard output. For a
+// formatter that cannot wait for its stop handler to do it; there is none yet.
+void arch_writeback_sc(const TraceRequest *request, pid_t pid, const TraceRegisters &regs,
+                       SyscallRecord *record);

@@ -40,8 +40,8 @@ struct SyscallAbi {
     unsigned long count;         // entries of `names`, and of `styles` and `subcalls`
     const char *const *names;
     const ArgStyle *styles;
-    const uint8_t *subcalls;           // the socketcall sub-call of each ArgStyle::SOCKET call
-    const char *const *signal_names;   // 32 slots; an empty one is null
+    const uint8_t *subcalls;          // the socketcall sub-call of each ArgStyle::SOCKET call
+    const char *const *signal_names;  // 32 slots; an empty one is null
 };
 
 // 32-bit MIPS with the O32 calling convention: calls from 4000, signals in MIPS numbering.
@@ -70,3 +70,12 @@ const char *socketcall_name(unsigned long subcall);
 
 // The name of signal `signo`, "Invalid" for a number without one.
 const char *signal_name(const SyscallAbi &abi, int signo);
+
+// A word of a tracee as an unsigned and as a signed number of this machine. Every word is shown
+// through one of these, so that a 32-bit tracee's numbers look the same on a 64-bit machine.
+inline unsigned long unsigned_word(const SyscallAbi &abi, unsigned long word) {
+    return abi.word_bits == 32 ? static_cast<uint32_t>(word) : word;
+}
+inline long signed_word(const SyscallAbi &abi, unsigned long word) {
+    return abi.word_bits == 32 ? static_cast<int32_t>(word) : static_cast<long>(word);
+}

@@ -32,6 +32,8 @@ constexpr int TRACED_NAME_SIZE = 32;
 struct TracedProcess {
     char name[TRACED_NAME_SIZE];  // last path component of its first command-line word, or empty
     uint32_t in_syscall;          // bit 0: the last system-call stop was an entry
+    bool stop_told;               // it was let go on with a signal that stops it
+    bool held;                    // left in the stop that such a signal made, until SIGCONT
     TraceRegisters regs;          // as at that entry
     unsigned long exit_record;    // the result word of the last exit stop
 };
@@ -43,12 +45,12 @@ struct TraceRequest {
     intptr_t cookie;          // handed to both
     TracedProcess *records;   // the engine's, one per entry of `pids`, while it runs
     uint32_t flags;
-    pid_t *pids;              // entries of -1 are skipped; the engine sets an ended one to -1
+    pid_t *pids;  // entries of -1 are skipped; the engine sets an ended one to -1
     int32_t nr_pids;
-    int32_t timeout_s;        // the trace ends after so many seconds; 0 or less: no limit
-    uint32_t attached;        // the caller is already the tracer of `pids`, which are stopped
-    char *buf;                // null, or text buffer from malloc, freed by the engine
-    uint32_t buf_size;        // 0, or its size
+    int32_t timeout_s;            // the trace ends after so many seconds; 0 or less: no limit
+    uint32_t attached;            // the caller is already the tracer of `pids`, which are stopped
+    char *buf;                    // null, or text buffer from malloc, freed by the engine
+    uint32_t buf_size;            // 0, or its size
     const TraceBackend *backend;  // null: this machine's own; tests put in another
 };
 
