@@ -41,7 +41,7 @@ constexpr StyleRow STYLE_ROWS[] = {
     {ArgStyle::MUNMAP, "0x%x0, %u1)"},
     {ArgStyle::STAT, "%s0, 0x%x1)"},
     {ArgStyle::FSTAT, "%f0, 0x%x1)"},
-    {ArgStyle::NANOSLEEP, "%P0%p1)"},
+    {ArgStyle::NANOSLEEP, "%P0%p1"},
     {ArgStyle::POLL, "0x%x0, %d1, %d2)"},
 };
 

@@ -1,0 +1,232 @@
+// The backend of the machine that the test runs on, against its real kernel.
+#include <errno.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/mman.h>
+#include <sys/prctl.h>
+#include <sys/ptrace.h>
+#include <sys/syscall.h>
+#include <sys/user.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <functional>
+
+#include "trace/backend.h"
+
+extern "C" char __executable_start, etext;
+
+namespace {
+
+// Read in the child's memory.
+volatile unsigned char child_bytes[] = {0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff,
+                                        0x01, 0x02, 0x03, 0x04, 0x05, 0x06, 0x07, 0x08};
+
+// A child that runs `body` and exits with its result, stopped at its first system call there.
+class Child {
+  public:
+    explicit Child(const std::function<long()> &body) {
+        pid_ = fork();
+        if (pid_ == 0) {
+            prctl(PR_SET_PDEATHSIG, SIGKILL);
+            ptrace(PTRACE_TRACEME, 0, 0, 0);
+            kill(getpid(), SIGSTOP);
+            syscall(SYS_exit_group, body());
+        }
+        EXPECT_EQ(waitpid(pid_, &status_, 0), pid_);
+        EXPECT_EQ(ptrace(PTRACE_SETOPTIONS, pid_, 0, PTRACE_O_TRACESYSGOOD | PTRACE_O_EXITKILL), 0);
+        // The end of kill() has no stop of its own: the child has stopped behind it.
+        next_stop();
+    }
+    ~Child() {
+        kill(pid_, SIGKILL);
+        waitpid(pid_, nullptr, 0);
+    }
+    Child(const Child &) = delete;
+    Child &operator=(const Child &) = delete;
+
+    pid_t pid() const { return pid_; }
+
+    // Goes on to the next system-call stop.
+    void next_stop() {
+        EXPECT_EQ(ptrace(PTRACE_SYSCALL, pid_, 0, 0), 0);
+        EXPECT_EQ(waitpid(pid_, &status_, 0), pid_);
+        EXPECT_TRUE(WIFSTOPPED(status_) && WSTOPSIG(status_) == (SIGTRAP | 0x80));
+    }
+
+    int exit_status() {
+        EXPECT_EQ(ptrace(PTRACE_CONT, pid_, 0, 0), 0);
+        EXPECT_EQ(waitpid(pid_, &status_, 0), pid_);
+        EXPECT_TRUE(WIFEXITED(status_));
+        return WEXITSTATUS(status_);
+    }
+
+  private:
+    pid_t pid_;
+    int status_ = 0;
+};
+
+long ask_for_parent() {
+    return syscall(SYS_getppid, 11, 12, 13, 14, 15, 16);
+}
+
+bool in_program(unsigned long address) {
+    return address >= reinterpret_cast<unsigned long>(&__executable_start) &&
+           address < reinterpret_cast<unsigned long>(&etext);
+}
+
+const TraceBackend &backend = native_backend();
+
+}  // namespace
+
+TEST(NativeBackend, ShowsARealCallAtItsEntryAndExit) {
+    Child child(ask_for_parent);
+    TraceRegisters regs = {};
+    SyscallRecord entry = {};
+    entry.writeback = 1;
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    backend.entry_record(child.pid(), regs, &entry);
+    EXPECT_EQ(entry.number, static_cast<unsigned long>(SYS_getppid));
+    EXPECT_EQ(entry.result, static_cast<unsigned long>(SYS_getppid));
+    EXPECT_EQ(entry.writeback, 0U);
+    for (unsigned long i = 0; i < 6; i++)
+        EXPECT_EQ(entry.arg[i], 11 + i);
+    EXPECT_NE(entry.pc, 0U);
+    EXPECT_FALSE(in_program(entry.pc));
+    EXPECT_TRUE(in_program(entry.ra)) << std::hex << entry.ra;
+    EXPECT_STREQ(syscall_name(*backend.abi, entry.number), "getppid");
+
+    child.next_stop();
+    SyscallRecord exit = {};
+    backend.exit_record(child.pid(), regs, &exit);
+    EXPECT_EQ(exit.result, static_cast<unsigned long>(getpid()));
+    EXPECT_EQ(exit.number, entry.number);
+    EXPECT_EQ(exit.pc, entry.pc);
+    EXPECT_EQ(exit.ra, entry.ra);
+    for (unsigned long i = 0; i < 6; i++)
+        EXPECT_EQ(exit.arg[i], 11 + i);
+}
+
+TEST(NativeBackend, ShowsAFailureAsTheKernelLeavesIt) {
+    Child child([] { return syscall(SYS_close, -1); });
+    TraceRegisters regs = {};
+    SyscallRecord record = {};
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    child.next_stop();
+    backend.exit_record(child.pid(), regs, &record);
+#if defined(__mips__)
+    EXPECT_EQ(signed_word(*backend.abi, record.result), EBADF);
+#else
+    EXPECT_EQ(signed_word(*backend.abi, record.result), -EBADF);
+#endif
+}
+
+TEST(NativeBackend, PutsAChangedResultBack) {
+    Child child(ask_for_parent);
+    TraceRegisters regs = {};
+    SyscallRecord record = {};
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    child.next_stop();
+    backend.exit_record(child.pid(), regs, &record);
+    record.result = 77;
+    backend.write_back(child.pid(), regs, record, false);
+    EXPECT_EQ(child.exit_status(), 77);
+}
+
+TEST(NativeBackend, PutsChangedArgumentsBack) {
+    Child child([] { return syscall(SYS_exit_group, 1); });
+    TraceRegisters regs = {};
+    SyscallRecord record = {};
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    backend.entry_record(child.pid(), regs, &record);
+    record.arg[0] = 78;
+    backend.write_back(child.pid(), regs, record, true);
+    EXPECT_EQ(child.exit_status(), 78);
+}
+
+TEST(NativeBackend, PutsAllArgumentsBack) {
+    Child child(ask_for_parent);
+    TraceRegisters regs = {};
+    SyscallRecord record = {};
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    backend.entry_record(child.pid(), regs, &record);
+    for (unsigned long i = 0; i < 6; i++)
+        record.arg[i] = 21 + i;
+    backend.write_back(child.pid(), regs, record, true);
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    backend.entry_record(child.pid(), regs, &record);
+    EXPECT_EQ(record.number, static_cast<unsigned long>(SYS_getppid));
+    for (unsigned long i = 0; i < 6; i++)
+        EXPECT_EQ(record.arg[i], 21 + i);
+}
+
+TEST(NativeBackend, CannotReadTheRegistersOfAStranger) {
+    TraceRegisters regs = {};
+    EXPECT_EQ(backend.read_entry(99999999, &regs), -1);
+}
+
+TEST(NativeBackend, PeeksMemoryAtAnyAddress) {
+    Child child(ask_for_parent);
+    const auto address = reinterpret_cast<unsigned long>(&child_bytes);
+    unsigned long word = 0;
+    ASSERT_EQ(backend.peek(child.pid(), address + 7, &word), 0);
+    EXPECT_EQ(word & 0xffffffff, 0x030201ffU);
+    errno = EIO;
+    ASSERT_EQ(backend.peek(child.pid(), address, &word), 0);
+    EXPECT_EQ(word & 0xffffffff, 0xffffffffU);
+}
+
+TEST(NativeBackend, CannotPeekWhereNothingIsMapped) {
+    const auto page = static_cast<size_t>(sysconf(_SC_PAGESIZE));
+    void *pages =
+        mmap(nullptr, 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    ASSERT_NE(pages, MAP_FAILED);
+    ASSERT_EQ(munmap(static_cast<char *>(pages) + page, page), 0);
+    Child child(ask_for_parent);
+    const unsigned long end = reinterpret_cast<unsigned long>(pages) + page;
+    unsigned long word = 55;
+    EXPECT_EQ(backend.peek(child.pid(), end - sizeof(long), &word), 0);
+    EXPECT_EQ(word, 0U);
+    word = 55;
+    EXPECT_EQ(backend.peek(child.pid(), end - 1, &word), -1);
+    EXPECT_NE(errno, 0);
+    EXPECT_EQ(backend.peek(child.pid(), 0, &word), -1);
+    EXPECT_EQ(word, 55U);
+    munmap(pages, page);
+}
+
+#if defined(__x86_64__)
+TEST(NativeBackend, HasNoReturnAddressWhereTheStackCannotBeRead) {
+    Child child(ask_for_parent);
+    user_regs_struct user;
+    ASSERT_EQ(ptrace(PTRACE_GETREGS, child.pid(), 0, &user), 0);
+    user.rsp = 8;
+    ASSERT_EQ(ptrace(PTRACE_SETREGS, child.pid(), 0, &user), 0);
+    TraceRegisters regs = {};
+    SyscallRecord record = {};
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    backend.entry_record(child.pid(), regs, &record);
+    EXPECT_EQ(record.ra, 0U);
+    EXPECT_EQ(record.arg[0], 11U);
+}
+
+TEST(NativeBackend, ReadsTheLastTwoArgumentsAfreshAtTheExit) {
+    Child child(ask_for_parent);
+    TraceRegisters regs = {};
+    SyscallRecord record = {};
+    ASSERT_EQ(backend.read_entry(child.pid(), &regs), 0);
+    child.next_stop();
+    user_regs_struct user;
+    ASSERT_EQ(ptrace(PTRACE_GETREGS, child.pid(), 0, &user), 0);
+    user.rdi = 91;
+    user.r10 = 94;
+    user.r8 = 95;
+    user.r9 = 96;
+    ASSERT_EQ(ptrace(PTRACE_SETREGS, child.pid(), 0, &user), 0);
+    backend.exit_record(child.pid(), regs, &record);
+    EXPECT_EQ(record.arg[0], 11U);
+    EXPECT_EQ(record.arg[3], 14U);
+    EXPECT_EQ(record.arg[4], 95U);
+    EXPECT_EQ(record.arg[5], 96U);
+}
+#endif
