@@ -35,14 +35,14 @@ struct CoreWriter {
 // Prints "pipes: ..." when it fails.
 bool make_pipe(UniqueFd *read_end, UniqueFd *write_end) {
     int ends[2];
-    if (pipe(ends) != 0) {
+    // The writer gets its ends as its standard streams and must hold no other copies: closing its
+    // standard error is how it says that no control line will come.
+    if (pipe2(ends, O_CLOEXEC) != 0) {
         perror("pipes");
         return false;
     }
     read_end->reset(ends[0]);
     write_end->reset(ends[1]);
-    // The writer must not hold its own pipes open for reading. Setting the flag cannot fail.
-    (void)fcntl(ends[0], F_SETFD, FD_CLOEXEC);
     return true;
 }
 

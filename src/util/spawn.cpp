@@ -1,6 +1,7 @@
 #include "util/spawn.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/ptrace.h>
@@ -9,11 +10,14 @@
 
 namespace {
 
-// Makes `given` the child's descriptor `standard`. Both calls may fail without harm: the program
-// then starts with that descriptor closed, as it would find it for itself.
+// Makes `given` the child's descriptor `standard`. The calls may fail without harm: the program then
+// starts with that descriptor closed, as it would find it for itself.
 void redirect(int given, int standard) {
-    if (given != standard)
-        (void)close(standard);
+    if (given == standard) {
+        (void)fcntl(standard, F_SETFD, 0);  // to be kept over the execve, whatever it was before
+        return;
+    }
+    (void)close(standard);
     (void)dup2(given, standard);
 }
 

@@ -8,11 +8,11 @@
 #include <vector>
 
 struct RunOptions {
-    std::string argv0;                  // instead of the path, when not empty
-    std::string input;                  // all of standard input
-    std::vector<std::string> env;       // the whole environment; the test's own when empty
+    std::string argv0{};                  // instead of the path, when not empty
+    std::string input{};                  // all of standard input
+    std::vector<std::string> env{};       // the whole environment; the test's own when empty
     int timeout_s = 60;                 // then it is killed, and the test fails
-    std::function<void()> before_exec;  // runs in the child
+    std::function<void()> before_exec{};  // runs in the child
 };
 
 struct RunResult {
