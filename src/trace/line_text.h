@@ -33,10 +33,10 @@ class LineText {
     }
 
     void add_char(char c) {
-        if (room() > 1)
+        if (room() > 0) {
             *end() = c;
-        if (room() > 0)
             buf_[std::min(length_ + 1, size_ - 1)] = '\0';
+        }
         length_++;
     }
 

@@ -2,12 +2,12 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <random>
 #include <string>
 
+#include "support/temp_dir.h"
 #include "unit/trace/guarded_buffer.h"
 #include "unit/trace/made_up_mips_kernel.h"
 #include "util/unique_fd.h"
@@ -63,19 +63,12 @@ TEST_F(ArgumentStyles, ShowTheBareNumberOfADescriptorThatIsNotOpen) {
 }
 
 TEST_F(ArgumentStyles, CutTheTextOfADescriptorTo127Characters) {
-    // Two levels, each with a name of 100 characters.
-    char directory[] = "/tmp/fdargXXXXXX";
-    ASSERT_NE(mkdtemp(directory), nullptr);
-    const std::string folder = std::string(directory) + "/" + std::string(100, 'd');
-    const std::string path = folder + "/" + std::string(100, 'f');
-    ASSERT_EQ(mkdir(folder.c_str(), 0700), 0);
-    const UniqueFd file(open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600));
-    ASSERT_TRUE(file.valid());
-    const auto fd = static_cast<unsigned long>(file.get());
-    EXPECT_EQ(fd_arg(getpid(), fd), std::to_string(fd) + " " + path.substr(0, 127));
-    unlink(path.c_str());
-    rmdir(folder.c_str());
-    rmdir(directory);
+    const TempDir dir;
+    const std::string path = dir.file(std::string(100, 'd') + "/" + std::string(100, 'f'), "");
+    const UniqueFd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    ASSERT_EQ(dup2(file.get(), 201), 201);
+    EXPECT_EQ(fd_arg(getpid(), 201), "201 " + path.substr(0, 127));
+    close(201);
 }
 
 TEST_F(ArgumentStyles, FitADescriptorIntoAnySpace) {

@@ -7,12 +7,18 @@
 #include <sys/prctl.h>
 #include <sys/ptrace.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <string>
 #include <vector>
+
+#include "support/temp_dir.h"
+#include "util/unique_fd.h"
 
 namespace {
 
@@ -71,20 +77,20 @@ class Request : public testing::Test {
     TraceRequest request = {};
 };
 
-// A child whose only open descriptor is 0, on `path`; it waits to be killed.
+// A child whose only open descriptor is 0, a copy of `fd`; it waits to be killed.
 class QuietChild {
   public:
-    explicit QuietChild(const char *path) {
+    explicit QuietChild(int fd) {
         int ready[2];
         EXPECT_EQ(pipe(ready), 0);
         pid_ = fork();
         if (pid_ == 0) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
             // The pipe's end becomes 1 and is closed as the last of all.
-            if (dup2(ready[1], 1) != 1 || dup2(open(path, O_RDONLY), 0) != 0)
+            if (dup2(ready[1], 1) != 1 || (fd != 0 && dup2(fd, 0) != 0))
                 _exit(1);
-            for (int fd = 2; fd < 4096; fd++)
-                close(fd);
+            for (int other = 2; other < 4096; other++)
+                close(other);
             close(1);
             for (;;)
                 pause();
@@ -170,7 +176,8 @@ TEST_F(Request, DropsTextWithoutACallback) {
 }
 
 TEST_F(Request, ListsTheDescriptorsOfAProcessPieceByPiece) {
-    const QuietChild child("/dev/null");
+    const UniqueFd null(open("/dev/null", O_RDONLY | O_CLOEXEC));
+    const QuietChild child(null.get());
     pid_t pid = child.pid();
     TracedProcess process = {};
     strcpy(process.name, "worker");
@@ -184,25 +191,43 @@ TEST_F(Request, ListsTheDescriptorsOfAProcessPieceByPiece) {
 }
 
 TEST_F(Request, GoesOnWithAListWhenTheCallbackAsksForTheEnd) {
-    const QuietChild child("/dev/null");
+    const UniqueFd null(open("/dev/null", O_RDONLY | O_CLOEXEC));
+    const QuietChild child(null.get());
     output_result = 0;
     trace_list_fds(&request, child.pid());
     EXPECT_EQ(pieces.size(), 4U);
 }
 
-TEST_F(Request, HandsOutNoMoreOfADescriptionThanIsInTheBuffer) {
-    char directory[] = "/tmp/fdlistXXXXXX";
-    ASSERT_NE(mkdtemp(directory), nullptr);
-    const std::string path = std::string(directory) + "/" + std::string(80, 'f');
-    close(open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600));
-    {
-        const QuietChild child(path.c_str());
-        trace_list_fds(&request, child.pid());
-    }
-    unlink(path.c_str());
-    rmdir(directory);
+TEST_F(Request, CutsTheTextOfAFileToTheBuffer) {
+    const TempDir dir;
+    const std::string path = dir.file(std::string(80, 'f'), "");
+    const UniqueFd file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    const QuietChild child(file.get());
+    trace_list_fds(&request, child.pid());
     ASSERT_EQ(pieces.size(), 4U);
     EXPECT_EQ(pieces[2], piece(path.substr(0, 63)));
+}
+
+// A socket's description has a length that counts what did not fit.
+TEST_F(Request, HandsOutNoMoreOfADescriptionThanIsInTheBuffer) {
+    const TempDir dir;
+    const std::string path = dir / std::string(60, 's');
+    sockaddr_un address = {};
+    address.sun_family = AF_UNIX;
+    strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+    const UniqueFd server(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    ASSERT_EQ(bind(server.get(), reinterpret_cast<sockaddr *>(&address), sizeof(address)), 0);
+    struct stat info;
+    ASSERT_EQ(fstat(server.get(), &info), 0);
+    char whole[256];
+    snprintf(whole, sizeof(whole), "socket:[%lu][%s]", static_cast<unsigned long>(info.st_ino),
+             path.c_str());
+    ASSERT_GT(strlen(whole), sizeof(buf));
+
+    const QuietChild child(server.get());
+    trace_list_fds(&request, child.pid());
+    ASSERT_EQ(pieces.size(), 4U);
+    EXPECT_EQ(pieces[2], piece(std::string(whole).substr(0, 63)));
 }
 
 // A callback closes the descriptor between its listing and its reading.
