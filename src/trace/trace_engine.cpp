@@ -1,1 +1,341 @@
-// (to come)
+#include "trace/trace_engine.h"
+
+#include <errno.h>
+#include <pthread.h>
+#include <signal.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/ptrace.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+
+#include "proc/process_table.h"
+#include "trace/stop_handlers.h"
+#include "trace/tracee_control.h"
+#include "util/spawn.h"
+#include "util/unique_fd.h"
+
+namespace {
+
+constexpr uint32_t DEFAULT_BUF_SIZE = 4096;
+constexpr uint32_t IN_SYSCALL = 1;            // the bit of TracedProcess::in_syscall
+constexpr int SYSCALL_STOP = SIGTRAP | 0x80;  // as PTRACE_O_TRACESYSGOOD marks it
+constexpr useconds_t HELD_POLL_US = 50 * 1000;
+
+// One trace at a time: the wait for any child would otherwise take the other trace's events.
+pthread_mutex_t trace_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+// A trace under way.
+struct Trace {
+    TraceRequest *request;
+    int live;     // processes that have not been seen to end
+    int held;     // processes with TracedProcess::held
+    pid_t timer;  // the child that measures the time limit, or -1
+};
+
+// Whether the caller wants the trace to go on.
+bool wanted(const Trace &trace) {
+    const TraceRequest &request = *trace.request;
+    return request.output_cb == nullptr || request.output_cb(request.cookie, request.buf, 0) != 0;
+}
+
+void set_held(Trace *trace, int index, bool held) {
+    TracedProcess &process = trace->request->records[index];
+    trace->held += static_cast<int>(held) - static_cast<int>(process.held);
+    process.held = held;
+}
+
+// Forgets a process that has ended or been detached.
+void drop(Trace *trace, int index) {
+    set_held(trace, index, false);
+    trace->request->pids[index] = -1;
+}
+
+// Lets a process go on to its next system-call stop; one that cannot is dropped.
+bool step(Trace *trace, int index, int sig) {
+    pid_t pid = trace->request->pids[index];
+    if (trace_syscall(pid, sig) != -1)
+        return true;
+    printf("WARNING: ptrace SYSCALL failed! %d\n", pid);
+    trace_detach(pid);
+    drop(trace, index);
+    return false;
+}
+
+// ---- Set-up ----
+
+bool provide_buffer(TraceRequest *request) {
+    if (request->buf != nullptr && request->buf_size != 0)
+        return true;
+    free(request->buf);
+    request->buf = static_cast<char *>(malloc(DEFAULT_BUF_SIZE));
+    request->buf_size = request->buf != nullptr ? DEFAULT_BUF_SIZE : 0;
+    return request->buf != nullptr;
+}
+
+// The last path component of the first command-line word, as far as that fits into the name.
+void read_process_name(pid_t pid, char (&name)[TRACED_NAME_SIZE]) {
+    char path[30];
+    (void)snprintf(path, sizeof path, "/proc/%d/cmdline", pid);
+    ssize_t len = read_file(path, name, sizeof name - 1);
+    name[len > 0 ? len : 0] = '\0';
+    const char *slash = strrchr(name, '/');
+    if (slash != nullptr)
+        memmove(name, slash + 1, strlen(slash + 1) + 1);
+}
+
+void take_process(Trace *trace, int index) {
+    TraceRequest *request = trace->request;
+    pid_t pid = request->pids[index];
+    if (request->attached == 0 && trace_attach(pid) == -1) {
+        drop(trace, index);
+        return;
+    }
+    unsigned long options = PTRACE_O_TRACESYSGOOD;
+    if ((request->flags & TRACE_EXIT_EVENT) != 0)
+        options |= PTRACE_O_TRACEEXIT;
+    trace_set_options(pid, options);
+    if (step(trace, index, 0))
+        ++trace->live;
+    read_process_name(pid, request->records[index].name);
+}
+
+// Starts the timer if there is a time limit. A trace that cannot be limited as asked must not run
+// without a limit: false.
+bool start_timer(Trace *trace) {
+    int32_t seconds = trace->request->timeout_s;
+    if (seconds <= 0)
+        return true;
+    char path[] = "/bin/sleep";
+    char duration[16];
+    (void)snprintf(duration, sizeof duration, "%d", seconds);
+    char *argv[] = {path, duration, nullptr};
+    trace->timer =
+        spawn_process_noenv(path, argv, STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO, false);
+    return trace->timer != -1;
+}
+
+// ---- The stops ----
+
+// Hands out the line of a system-call entry or exit.
+void show_syscall(Trace *trace, int index) {
+    TraceRequest *request = trace->request;
+    TracedProcess &process = request->records[index];
+    pid_t pid = request->pids[index];
+    SyscallRecord record = {};
+    int length;
+    if ((process.in_syscall & IN_SYSCALL) != 0) {
+        length = syscall_exit_stop(request, pid, &record, request->buf, request->buf_size,
+                                   &process.regs, &process.exit_record);
+        if (length != 0)
+            process.in_syscall &= ~IN_SYSCALL;
+    } else {
+        length = syscall_entry_stop(request, pid, &record, request->buf, request->buf_size,
+                                    &process.regs);
+        if (length != -1) {
+            process.in_syscall |= IN_SYSCALL;
+        } else {
+            // An entry that cannot be shown is shown as the exit of the call before, less its
+            // newline, and its own exit is tried as an entry.
+            length = syscall_exit_stop(request, pid, &record, request->buf, request->buf_size,
+                                       &process.regs, &process.exit_record) -
+                     1;
+        }
+    }
+    if (request->output_cb == nullptr)
+        return;
+    // The length is that of the whole line, of which the buffer holds what fitted.
+    uint32_t shown = std::min(static_cast<uint32_t>(std::max(length, 0)), request->buf_size - 1);
+    (void)request->output_cb(request->cookie, request->buf, shown);
+}
+
+void on_syscall_stop(Trace *trace, int index) {
+    if ((trace->request->flags & TRACE_SYSCALLS) != 0)
+        show_syscall(trace, index);
+    (void)step(trace, index, 0);
+}
+
+void on_event_stop(Trace *trace, int index) {
+    pid_t pid = trace->request->pids[index];
+    trace_event(trace->request, pid, TRACE_EVENT_STOP, 0, nullptr);
+    (void)step(trace, index, trace_trap_signal(pid));
+}
+
+void on_signal_stop(Trace *trace, int index, int sig) {
+    TraceRequest *request = trace->request;
+    TracedProcess &process = request->records[index];
+    pid_t pid = request->pids[index];
+    bool stopped = trace_in_job_stop(pid, sig);
+    // A stop that is the effect of the signal shown before is not told again.
+    bool told = stopped && process.stop_told;
+    process.stop_told = !stopped;
+    if ((request->flags & TRACE_SIGNALS) != 0 && !told)
+        trace_printf(request, "\n[%d %s] ---  SIGNAL %d %s ---\n\n", pid, process.name, sig,
+                     signal_name(*trace_backend(request).abi, sig));
+    if (stopped)
+        set_held(trace, index, true);
+    else
+        (void)step(trace, index, sig);
+}
+
+void on_stop(Trace *trace, int index, int status) {
+    int sig = WSTOPSIG(status);
+    // The bits of the second test lie in the signal's own byte, where SIGTRAP has one of them: so
+    // every SIGTRAP is told as an event, a breakpoint's too, and not only the exit event.
+    bool event = sig == SIGTRAP && (status & 0x600) != 0;
+    if (sig == SYSCALL_STOP || event)
+        trace->request->records[index].stop_told = false;
+    if (sig == SYSCALL_STOP)
+        on_syscall_stop(trace, index);
+    else if (event)
+        on_event_stop(trace, index);
+    else
+        on_signal_stop(trace, index, sig);
+}
+
+// ---- The loop ----
+
+// Lets processes go on that were held and have been sent SIGCONT. The kernel wakes a tracee for no
+// signal but SIGKILL, and does not tell its tracer either; but the "continued" state that it keeps
+// for the parent can be looked at without taking it away.
+void step_continued(Trace *trace) {
+    TraceRequest *request = trace->request;
+    for (int i = 0; i < request->nr_pids; ++i) {
+        if (!request->records[i].held)
+            continue;
+        siginfo_t info = {};
+        if (waitid(P_PID, static_cast<id_t>(request->pids[i]), &info,
+                   WCONTINUED | WNOHANG | WNOWAIT) != -1 &&
+            info.si_code == CLD_CONTINUED) {
+            set_held(trace, i, false);
+            (void)step(trace, i, 0);
+        }
+    }
+}
+
+// waitpid for any child or tracee.
+pid_t wait_for_event(Trace *trace, int *status) {
+    while (trace->held > 0) {
+        pid_t pid = waitpid(-1, status, WNOHANG | __WALL);
+        if (pid != 0)
+            return pid;
+        step_continued(trace);
+        if (usleep(HELD_POLL_US) == -1)
+            return -1;
+    }
+    return waitpid(-1, status, __WALL);
+}
+
+// Acts on the wait status of a process. Returns whether the trace goes on.
+bool on_status(Trace *trace, int index, int status) {
+    set_held(trace, index, false);
+    if (WIFEXITED(status)) {
+        drop(trace, index);
+        return --trace->live != 0;
+    }
+    if (WIFSIGNALED(status)) {
+        // Also the last one's death leaves the end of the trace to the next wait, which finds no
+        // child any more, or else the time limit.
+        drop(trace, index);
+        --trace->live;
+        return true;
+    }
+    if (WIFSTOPPED(status))
+        on_stop(trace, index, status);
+    return true;
+}
+
+void follow(Trace *trace) {
+    for (;;) {
+        int status;
+        pid_t pid = wait_for_event(trace, &status);
+        int error = errno;
+        bool expired = trace->timer != -1 && pid == trace->timer;
+        if (expired)
+            trace->timer = -1;
+        if (!wanted(*trace) || expired)
+            return;
+        if (pid == -1) {
+            if (error == ECHILD || (error == EINTR && !wanted(*trace)))
+                return;
+            continue;
+        }
+        // Other children of this process end, too; they are of no interest.
+        int index = pid_index(pid, trace->request->pids, trace->request->nr_pids);
+        if (index >= 0 && !on_status(trace, index, status))
+            return;
+    }
+}
+
+// ---- Clean-up ----
+
+// The signal that ends the timer. SIGINT would not if it is ignored or blocked here, as below a
+// shell's "&": the timer has inherited that.
+int timer_signal() {
+    struct sigaction action;
+    sigset_t blocked;
+    bool effective = sigaction(SIGINT, nullptr, &action) == 0 && action.sa_handler != SIG_IGN &&
+                     pthread_sigmask(SIG_BLOCK, nullptr, &blocked) == 0 &&
+                     sigismember(&blocked, SIGINT) == 0;
+    return effective ? SIGINT : SIGKILL;
+}
+
+void stop_timer(Trace *trace) {
+    if (trace->timer == -1)
+        return;
+    (void)kill(trace->timer, timer_signal());
+    while (waitpid(trace->timer, nullptr, 0) == -1 && errno == EINTR) {
+    }
+    trace->timer = -1;
+}
+
+void release_processes(TraceRequest *request, bool list_fds) {
+    for (int i = 0; i < request->nr_pids; ++i) {
+        if (request->pids[i] == -1)
+            continue;
+        if (list_fds)
+            trace_list_fds(request, request->pids[i]);
+        trace_detach(request->pids[i]);
+    }
+}
+
+// The trace proper, with records and buffer in place.
+void run(TraceRequest *request) {
+    Trace trace = {.request = request, .live = 0, .held = 0, .timer = -1};
+    for (int i = 0; i < request->nr_pids; ++i) {
+        if (request->pids[i] != -1)
+            take_process(&trace, i);
+    }
+    if (trace.live == 0)
+        return;
+    if (start_timer(&trace))
+        follow(&trace);
+    stop_timer(&trace);
+    release_processes(request, (request->flags & TRACE_LIST_FDS) != 0);
+}
+
+}  // namespace
+
+void trace_run(TraceRequest *request) {
+    // One more than there are processes: an empty table is not a failed allocation.
+    UniqueBlock<TracedProcess> records(static_cast<TracedProcess *>(
+        calloc(static_cast<size_t>(request->nr_pids) + 1, sizeof(TracedProcess))));
+    if (records != nullptr) {
+        (void)pthread_mutex_lock(&trace_mutex);
+        request->records = records.get();
+        if (provide_buffer(request))
+            run(request);
+        else if (request->attached != 0)
+            release_processes(request, false);
+        request->records = nullptr;
+        (void)pthread_mutex_unlock(&trace_mutex);
+    } else if (request->attached != 0) {
+        release_processes(request, false);
+    }
+    free(request->buf);
+    request->buf = nullptr;
+    request->buf_size = 0;
+}

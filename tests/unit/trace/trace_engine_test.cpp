@@ -1,0 +1,813 @@
+#include "trace/trace_engine.h"
+
+#include <dirent.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <stdio.h>
+#include <sys/stat.h>
+#include <sys/time.h>
+#include <time.h>
+
+#include <atomic>
+#include <thread>
+
+#include "support/sandbox.h"
+#include "unit/trace/tracees.h"
+
+namespace {
+
+double seconds() {
+    timespec now;
+    clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) * 1e-9;
+}
+
+int open_descriptors() {
+    DIR *dir = opendir("/proc/self/fd");
+    int count = 0;
+    while (readdir(dir) != nullptr)
+        ++count;
+    closedir(dir);
+    return count;
+}
+
+bool has_children() {
+    return waitpid(-1, nullptr, WNOHANG) != -1 || errno != ECHILD;
+}
+
+size_t count_of(const std::string &text, const std::string &part) {
+    size_t count = 0;
+    for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1))
+        ++count;
+    return count;
+}
+
+// The name that a trace shows for a child of the test.
+std::string own_name() {
+    return program_invocation_short_name;
+}
+
+// How often the descriptors of `pid` were listed.
+int listings(const TraceLog &log, pid_t pid) {
+    std::string start = "\n[" + std::to_string(pid) + " " + own_name() + "] ";
+    std::string end = " open fds:\n";
+    int count = 0;
+    for (const std::string &text : log.texts)
+        count += text.rfind(start, 0) == 0 && text.size() > end.size() &&
+                 text.substr(text.size() - end.size()) == end;
+    return count;
+}
+
+// Keeps a hanging trace from hanging the test run.
+class TraceRun : public testing::Test {
+  protected:
+    void SetUp() override { alarm(100); }
+    void TearDown() override { alarm(0); }
+};
+
+// ---- What ends a trace ----
+
+TEST_F(TraceRun, WithEveryPidRefusedEndsWithoutATimerAndWithoutACallback) {
+    pid_t gone;
+    {
+        Child child(sleep_for_ever);
+        gone = child.pid();
+    }
+    TraceLog log;
+    std::vector<pid_t> pids = {gone, -1, getpid(), gone};
+    TraceRequest request = request_for(&log, &pids, UINT32_MAX);
+    request.timeout_s = 1000;
+    trace_run(&request);
+    EXPECT_EQ(log.polls, 0);
+    EXPECT_EQ(log.all(), "");
+    EXPECT_EQ(pids, (std::vector<pid_t>{-1, -1, -1, -1}));
+    EXPECT_FALSE(has_children());
+}
+
+TEST_F(TraceRun, WithoutAnyPidEndsAtOnce) {
+    TraceLog log;
+    std::vector<pid_t> pids;
+    TraceRequest request = request_for(&log, &pids, UINT32_MAX);
+    request.timeout_s = 1000;
+    trace_run(&request);
+    EXPECT_EQ(log.polls, 0);
+    EXPECT_FALSE(has_children());
+}
+
+TEST_F(TraceRun, EndsWhenTheTimeLimitHasPassedAndLetsASleepingProcessGoOn) {
+    Child child(sleep_for_ever);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.timeout_s = 2;
+    double start = seconds();
+    trace_run(&request);
+    EXPECT_GE(seconds() - start, 1.9);
+    EXPECT_LT(seconds() - start, 20);
+    EXPECT_EQ(pids[0], child.pid());
+    EXPECT_TRUE(runs_free(child.pid()));
+}
+
+TEST_F(TraceRun, ACallbackThatRefusesAtItsFirstPollEndsItAfterTheFirstWait) {
+    Child child(call_for_ever);
+    TraceLog log;
+    log.polls_wanted = 1;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.timeout_s = 1000;
+    trace_run(&request);
+    EXPECT_EQ(log.polls, 1);
+    EXPECT_EQ(log.all(), "");
+    EXPECT_TRUE(runs_free(child.pid()));
+    EXPECT_EQ(waitpid(-1, nullptr, WNOHANG), 0) << "only the traced process is left as a child";
+}
+
+TEST_F(TraceRun, StopsItsTimerWithSigint) {
+    run_in_sandbox([] {
+        TempDir dir;
+        mkfifo((dir / "fifo").c_str(), 0600);
+        std::string script = dir.file("sleep",
+                                      "#!/bin/sh\n"
+                                      "trap 'echo INT >> " +
+                                          (dir / "signals") +
+                                          "; kill $!; exit' INT\n"
+                                          "/bin/cat " +
+                                          (dir / "fifo") +
+                                          " &\n"
+                                          "echo \"$@\" > " +
+                                          (dir / "started") +
+                                          "\n"
+                                          "wait\n",
+                                      0755);
+        sandbox_bind(script, "/bin/sleep");
+        Child child(call_for_ever);
+        TraceLog log;
+        log.end_when = [&] {
+            struct stat status;
+            return stat((dir / "started").c_str(), &status) == 0 && status.st_size > 0;
+        };
+        std::vector<pid_t> pids = {child.pid()};
+        TraceRequest request = request_for(&log, &pids);
+        request.timeout_s = 77;
+        trace_run(&request);
+        EXPECT_EQ(read_whole_file(dir / "started"), "77\n");
+        EXPECT_EQ(read_whole_file(dir / "signals"), "INT\n");
+    });
+}
+
+TEST_F(TraceRun, StopsItsTimerAlsoWhereSigintIsIgnored) {
+    for (bool block : {false, true}) {
+        Child tracer([block] {
+            sigset_t interrupt;
+            sigemptyset(&interrupt);
+            sigaddset(&interrupt, SIGINT);
+            if (block)
+                pthread_sigmask(SIG_BLOCK, &interrupt, nullptr);
+            else
+                signal(SIGINT, SIG_IGN);
+            Child child(call_for_ever);
+            TraceLog log;
+            log.polls_wanted = 1;
+            std::vector<pid_t> pids = {child.pid()};
+            TraceRequest request = request_for(&log, &pids);
+            request.timeout_s = 1000;
+            trace_run(&request);
+            _exit(waitpid(-1, nullptr, WNOHANG) == 0 ? 0 : 1);
+        });
+        int status = -1;
+        ASSERT_TRUE(wait_until([&] { return waitpid(tracer.pid(), &status, WNOHANG) != 0; }));
+        EXPECT_EQ(status, 0);
+    }
+}
+
+TEST_F(TraceRun, EndsAtOnceWhenItsTimerCannotBeExecuted) {
+    run_in_sandbox([] {
+        TempDir dir;
+        sandbox_bind(dir.file("sleep", "no program\n", 0644), "/bin/sleep");
+        Child child(sleep_for_ever);
+        TraceLog log;
+        std::vector<pid_t> pids = {child.pid()};
+        TraceRequest request = request_for(&log, &pids);
+        request.timeout_s = 1000;
+        double start = seconds();
+        trace_run(&request);
+        EXPECT_LT(seconds() - start, 20);
+        EXPECT_TRUE(runs_free(child.pid()));
+    });
+}
+
+TEST_F(TraceRun, EndsWithTheExitOfItsLastProcess) {
+    Child first([] { _exit(1); }, Child::HELD);
+    Child second([] { _exit(2); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {first.pid(), -1, second.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
+    request.attached = 1;
+    request.timeout_s = 1000;
+    trace_run(&request);
+    EXPECT_EQ(pids, (std::vector<pid_t>{-1, -1, -1}));
+    EXPECT_FALSE(has_children());
+}
+
+TEST_F(TraceRun, EndsAfterADeathBySignalWhenThereIsNothingMoreToWaitFor) {
+    Child child([] { raise(SIGKILL); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids);
+    request.attached = 1;
+    trace_run(&request);
+    EXPECT_EQ(pids[0], -1);
+    EXPECT_FALSE(has_children());
+}
+
+TEST_F(TraceRun, LeavesTheEndToTheTimerWhenItsLastProcessDiesOfASignal) {
+    Child child([] { raise(SIGKILL); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids);
+    request.attached = 1;
+    request.timeout_s = 1;
+    double start = seconds();
+    trace_run(&request);
+    EXPECT_EQ(pids[0], -1);
+    EXPECT_GE(seconds() - start, 0.9);
+    EXPECT_FALSE(has_children());
+}
+
+TEST_F(TraceRun, AsksTwiceAfterASignalInterruptedItsWait) {
+    struct sigaction action = {};
+    action.sa_handler = [](int) {};
+    struct sigaction before;
+    sigaction(SIGUSR1, &action, &before);
+    Child child(sleep_for_ever);
+    pid_t test = getpid();
+    Child sender([test] {
+        for (;;) {
+            usleep(20000);
+            kill(test, SIGUSR1);
+        }
+    });
+    TraceLog log;
+    log.polls_wanted = 4;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids);
+    trace_run(&request);
+    // Two rounds of the wait failing; the fourth poll is the second one of the second round.
+    EXPECT_EQ(log.polls, 4);
+    EXPECT_TRUE(runs_free(child.pid()));
+    sigaction(SIGUSR1, &before, nullptr);
+}
+
+TEST_F(TraceRun, TakesNoNoticeOfOtherChildren) {
+    Child child(
+        [] {
+            for (int i = 0; i < 200; ++i)
+                syscall(SYS_getppid);
+            _exit(0);
+        },
+        Child::HELD);
+    Child stranger([] { _exit(3); });
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids);
+    request.attached = 1;
+    trace_run(&request);
+    EXPECT_EQ(pids[0], -1);
+}
+
+// ---- How processes are left ----
+
+struct Behaviour {
+    const char *name;
+    void (*body)();
+};
+
+void receive_signals() {
+    signal(SIGALRM, [](int) { syscall(SYS_getppid); });
+    itimerval often = {{0, 300}, {0, 300}};
+    setitimer(ITIMER_REAL, &often, nullptr);
+    sleep_for_ever();
+}
+
+void yield_and_sleep() {
+    for (;;)
+        usleep(50);
+}
+
+class TraceRunLeaves : public testing::TestWithParam<Behaviour> {};
+
+TEST_P(TraceRunLeaves, TheProcessNeitherStoppedNorTraced) {
+    alarm(100);
+    Child child(GetParam().body);
+    bool sleeps = GetParam().body == sleep_for_ever || GetParam().body == spin_for_ever;
+    for (int round = 1; round <= (sleeps ? 1 : 60); ++round) {
+        TraceLog log;
+        log.polls_wanted = round;
+        std::vector<pid_t> pids = {child.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+        request.timeout_s = 1;
+        trace_run(&request);
+        ASSERT_EQ(pids[0], child.pid());
+        ASSERT_TRUE(runs_free(child.pid())) << process_state(child.pid()) << " in round " << round;
+    }
+    alarm(0);
+}
+
+INSTANTIATE_TEST_SUITE_P(Processes, TraceRunLeaves,
+                         testing::Values(Behaviour{"Sleeping", sleep_for_ever},
+                                         Behaviour{"Spinning", spin_for_ever},
+                                         Behaviour{"Calling", call_for_ever},
+                                         Behaviour{"SleepingAndWaking", yield_and_sleep},
+                                         Behaviour{"ReceivingSignals", receive_signals}),
+                         [](const auto &test) { return test.param.name; });
+
+TEST_F(TraceRun, LetsGoOfAProcessThatIsNotItsChild) {
+    int pipe_fds[2];
+    ASSERT_EQ(pipe(pipe_fds), 0);
+    Child parent([&] {
+        Child grandchild(call_for_ever);
+        pid_t pid = grandchild.pid();
+        (void)!write(pipe_fds[1], &pid, sizeof pid);
+        sleep_for_ever();
+    });
+    pid_t pid;
+    ASSERT_EQ(read(pipe_fds[0], &pid, sizeof pid), static_cast<ssize_t>(sizeof pid));
+    for (int round = 1; round <= 20; ++round) {
+        TraceLog log;
+        log.polls_wanted = round;
+        std::vector<pid_t> pids = {pid};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+        trace_run(&request);
+        ASSERT_TRUE(runs_free(pid));
+    }
+    kill(pid, SIGKILL);
+    close(pipe_fds[0]);
+    close(pipe_fds[1]);
+}
+
+TEST_F(TraceRun, LetsManyProcessesGoAtOnce) {
+    Child sleeping(sleep_for_ever), spinning(spin_for_ever), calling(call_for_ever);
+    Child waking(yield_and_sleep), signalled(receive_signals);
+    TraceLog log;
+    log.polls_wanted = 500;
+    std::vector<pid_t> pids = {sleeping.pid(), spinning.pid(), calling.pid(), waking.pid(),
+                               signalled.pid()};
+    TraceRequest request = request_for(&log, &pids, UINT32_MAX);
+    trace_run(&request);
+    for (pid_t pid : pids)
+        EXPECT_TRUE(runs_free(pid)) << process_state(pid);
+}
+
+TEST_F(TraceRun, SurvivesProcessesThatEndWhileItLetsThemGo) {
+    for (int round = 0; round < 60; ++round) {
+        auto body = [round] {
+            for (int i = 0; i < round; ++i)
+                syscall(SYS_getppid);
+            _exit(0);
+        };
+        Child first(body, Child::HELD), second(body, Child::HELD), third(body, Child::HELD);
+        TraceLog log;
+        log.polls_wanted = 3 * round;
+        std::vector<pid_t> pids = {first.pid(), second.pid(), third.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS | TRACE_EXIT_EVENT);
+        request.attached = 1;
+        trace_run(&request);
+        for (pid_t pid : pids)
+            EXPECT_TRUE(pid == -1 ||
+                        wait_until([&] { return waitpid(pid, nullptr, WNOHANG) != 0; }))
+                << "does not come to its end";
+    }
+}
+
+TEST_F(TraceRun, SurvivesProcessesThatAreKilledMeanwhile) {
+    for (int round = 0; round < 20; ++round) {
+        Child child(call_for_ever);
+        pid_t pid = child.pid();
+        Child killer([pid, round] {
+            usleep(static_cast<useconds_t>(round) * 300);
+            kill(pid, SIGKILL);
+        });
+        TraceLog log;
+        std::vector<pid_t> pids = {pid};
+        TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
+        trace_run(&request);
+        EXPECT_EQ(pids[0], -1);
+    }
+}
+
+TEST_F(TraceRun, LetsGoAlsoWhileSignalsInterruptIt) {
+    struct sigaction action = {};
+    action.sa_handler = [](int) {};
+    struct sigaction before;
+    sigaction(SIGUSR1, &action, &before);
+    Child spinning(spin_for_ever), sleeping(sleep_for_ever);
+    pid_t test = getpid();
+    Child sender([test] {
+        for (;;)
+            kill(test, SIGUSR1);
+    });
+    for (int round = 0; round < 40; ++round) {
+        TraceLog log;
+        log.polls_wanted = 1;
+        std::vector<pid_t> pids = {spinning.pid(), sleeping.pid()};
+        TraceRequest request = request_for(&log, &pids);
+        trace_run(&request);
+        // Whether an interrupted attach is given up or not: nothing is left behind.
+        ASSERT_TRUE(runs_free(spinning.pid())) << process_state(spinning.pid());
+        ASSERT_TRUE(runs_free(sleeping.pid())) << process_state(sleeping.pid());
+    }
+    kill(sender.pid(), SIGKILL);
+    sigaction(SIGUSR1, &before, nullptr);
+}
+
+// A process with two threads; the test gets the number of the second.
+struct Threaded {
+    int pipe_fds[2];
+
+    static void *run_second(void *self) {
+        pid_t tid = static_cast<pid_t>(syscall(SYS_gettid));
+        (void)!write(static_cast<Threaded *>(self)->pipe_fds[1], &tid, sizeof tid);
+        spin_for_ever();
+        return nullptr;
+    }
+
+    void start() {
+        pthread_t thread;
+        pthread_create(&thread, nullptr, run_second, this);
+    }
+
+    pid_t second() {
+        pid_t tid = -1;
+        (void)!read(pipe_fds[0], &tid, sizeof tid);
+        return tid;
+    }
+
+    Threaded() { (void)!pipe(pipe_fds); }
+    ~Threaded() {
+        close(pipe_fds[0]);
+        close(pipe_fds[1]);
+    }
+};
+
+TEST_F(TraceRun, LeavesTheUntracedThreadsOfAProcessRunning) {
+    Threaded threaded;
+    Child child([&] {
+        threaded.start();
+        spin_for_ever();
+    });
+    pid_t second = threaded.second();
+    for (int round = 0; round < 60; ++round) {
+        TraceLog log;
+        std::vector<pid_t> pids = {round % 2 == 0 ? child.pid() : second};
+        TraceRequest request = request_for(&log, &pids);
+        // A process that only spins brings no event: the trace ends with that of another child.
+        Child other([] { _exit(0); });
+        log.polls_wanted = 1;
+        trace_run(&request);
+        ASSERT_NE(pids[0], -1);
+        ASSERT_TRUE(runs_free(child.pid())) << process_state(child.pid());
+        ASSERT_TRUE(runs_free(second)) << process_state(second);
+    }
+}
+
+TEST_F(TraceRun, EndsInTimeThoughAMainThreadHasEndedBeforeItsProcess) {
+    Threaded threaded;
+    Child child(
+        [&] {
+            threaded.start();
+            syscall(SYS_exit, 0);
+        },
+        Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.attached = 1;
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_EQ(process_state(child.pid()), 'Z');
+    EXPECT_TRUE(runs_free(threaded.second()));
+}
+
+// ---- Signals and stops ----
+
+TEST_F(TraceRun, ShowsAStopFromOutsideOnceAndLeavesTheProcessStopped) {
+    Child child(yield_and_sleep, Child::HELD);
+    pid_t pid = child.pid();
+    Child outsider([pid] { kill(pid, SIGSTOP); });
+    TraceLog log;
+    std::vector<pid_t> pids = {pid};
+    TraceRequest request = request_for(&log, &pids, TRACE_SIGNALS);
+    request.attached = 1;
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_EQ(log.all(), "\n[" + std::to_string(pid) + " " + own_name() + "] ---  SIGNAL " +
+                             std::to_string(SIGSTOP) + " SIGSTOP ---\n\n");
+    EXPECT_TRUE(wait_until([&] { return process_state(pid) == 'T'; })) << process_state(pid);
+    EXPECT_EQ(status_field(pid, "TracerPid:\t"), "0");
+    kill(pid, SIGCONT);
+    EXPECT_TRUE(runs_free(pid));
+}
+
+TEST_F(TraceRun, KeepsAStoppedProcessStoppedUntilItIsContinued) {
+    int pipe_fds[2];
+    ASSERT_EQ(pipe(pipe_fds), 0);
+    Child child(
+        [&] {
+            kill(getpid(), SIGSTOP);
+            char go = 1;
+            (void)!write(pipe_fds[1], &go, 1);
+            _exit(0);
+        },
+        Child::HELD);
+    pid_t pid = child.pid();
+    Child outsider([&] {
+        // Long enough for a process that is not stopped to go on.
+        usleep(300000);
+        char went_on;
+        fcntl(pipe_fds[0], F_SETFL, O_NONBLOCK);
+        bool stopped = read(pipe_fds[0], &went_on, 1) == -1;
+        kill(pid, stopped ? SIGCONT : SIGKILL);
+    });
+    TraceLog log;
+    std::vector<pid_t> pids = {pid};
+    TraceRequest request = request_for(&log, &pids, TRACE_SIGNALS | TRACE_EXIT_EVENT);
+    request.attached = 1;
+    request.timeout_s = 20;
+    trace_run(&request);
+    EXPECT_EQ(pids[0], -1) << "it has come to its end";
+    ASSERT_EQ(log.events.size(), 1u);
+    EXPECT_EQ(log.events[0].second, 0u) << "of its own";
+    EXPECT_EQ(count_of(log.all(), "SIGNAL"), 2u) << log.all();
+    EXPECT_EQ(count_of(log.all(), "SIGCONT"), 1u) << log.all();
+    close(pipe_fds[0]);
+    close(pipe_fds[1]);
+}
+
+TEST_F(TraceRun, AttachesToAStoppedProcessAndLeavesItStopped) {
+    Child child(yield_and_sleep);
+    kill(child.pid(), SIGSTOP);
+    ASSERT_TRUE(wait_until([&] { return process_state(child.pid()) == 'T'; }));
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SIGNALS);
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_TRUE(wait_until([&] { return process_state(child.pid()) == 'T'; }));
+    EXPECT_EQ(status_field(child.pid(), "TracerPid:\t"), "0");
+    kill(child.pid(), SIGCONT);
+    EXPECT_TRUE(runs_free(child.pid()));
+}
+
+TEST_F(TraceRun, DeliversSignals) {
+    Child child(
+        [] {
+            signal(SIGUSR1, [](int) { _exit(42); });
+            raise(SIGUSR1);
+        },
+        Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
+    request.attached = 1;
+    trace_run(&request);
+    ASSERT_EQ(log.events.size(), 1u);
+    EXPECT_EQ(log.events[0].second, 42u << 8);
+    EXPECT_EQ(log.all(), "") << "no text without its flag";
+}
+
+TEST_F(TraceRun, TellsASigtrapAsAnEventAndDeliversIt) {
+    Child child(
+        [] {
+            signal(SIGTRAP, [](int) { _exit(9); });
+            raise(SIGTRAP);
+        },
+        Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT | TRACE_SIGNALS);
+    request.attached = 1;
+    trace_run(&request);
+    ASSERT_EQ(log.events.size(), 2u) << "the SIGTRAP and the exit";
+    EXPECT_EQ(log.events[0].first, TRACE_EVENT_STOP);
+    EXPECT_EQ(log.events[1].second, 9u << 8);
+    EXPECT_EQ(log.all(), "") << "no SIGNAL line";
+}
+
+TEST_F(TraceRun, LetsAProcessLiveThatReplacesItself) {
+    Child child([] { execl("/bin/sh", "sh", "-c", "exit 6", nullptr); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
+    request.attached = 1;
+    trace_run(&request);
+    ASSERT_FALSE(log.events.empty());
+    EXPECT_EQ(log.events.back().second, 6u << 8);
+}
+
+TEST_F(TraceRun, DoesNotStopAProcessThatAnotherThreadReplaced) {
+    Threaded threaded;
+    static int pipe_fds[2];
+    ASSERT_EQ(pipe2(pipe_fds, 0), 0);
+    Child child(
+        [] {
+            pthread_t thread;
+            pthread_create(
+                &thread, nullptr,
+                [](void *) -> void * {
+                    execl("/bin/sh", "sh", "-c", "echo; while :; do :; done", nullptr);
+                    _exit(1);
+                },
+                nullptr);
+            dup2(pipe_fds[1], 1);
+            sleep_for_ever();
+        },
+        Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids);
+    request.attached = 1;
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_TRUE(runs_free(child.pid())) << process_state(child.pid());
+    close(pipe_fds[0]);
+    close(pipe_fds[1]);
+}
+
+// ---- Text and records ----
+
+TEST_F(TraceRun, TellsAnExitCallAndTheExitEventAndListsDescriptorsAtBoth) {
+    Child child([] { syscall(SYS_exit_group, 3); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request =
+        request_for(&log, &pids, TRACE_SYSCALLS | TRACE_EXIT_EVENT | TRACE_LIST_FDS);
+    request.attached = 1;
+    trace_run(&request);
+    using Event = std::pair<int, unsigned long>;
+    EXPECT_EQ(log.events, (std::vector<Event>{{2, 3}, {1, 768}}));
+    EXPECT_EQ(listings(log, child.pid()), 2);
+}
+
+TEST_F(TraceRun, ListsTheDescriptorsOfEveryProcessThatIsLeft) {
+    Child first(sleep_for_ever), second(sleep_for_ever);
+    TraceLog log;
+    std::vector<pid_t> pids = {first.pid(), second.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_LIST_FDS);
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_EQ(listings(log, first.pid()), 1);
+    EXPECT_EQ(listings(log, second.pid()), 1);
+    std::string text = log.all();
+    EXPECT_LT(text.find("\n[" + std::to_string(first.pid())),
+              text.find("\n[" + std::to_string(second.pid())));
+}
+
+TEST_F(TraceRun, HandsOutNoMoreThanTheBufferHolds) {
+    Child child([] { syscall(SYS_getppid); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.attached = 1;
+    request.buf_size = 12;
+    request.buf = static_cast<char *>(malloc(12));
+    trace_run(&request);
+    EXPECT_EQ(request.buf, nullptr) << "the caller's buffer has been freed";
+    ASSERT_FALSE(log.texts.empty());
+    std::string whole = "[" + std::to_string(child.pid()) + " " + own_name() + "]";
+    for (const std::string &text : log.texts)
+        EXPECT_EQ(text, whole.substr(0, 11));
+}
+
+TEST_F(TraceRun, ProvidesABufferWhenEitherHalfOfItIsMissing) {
+    for (bool with_memory : {false, true}) {
+        Child child([] { syscall(SYS_getppid); }, Child::HELD);
+        TraceLog log;
+        std::vector<pid_t> pids = {child.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+        request.attached = 1;
+        request.buf = with_memory ? static_cast<char *>(malloc(8)) : nullptr;
+        request.buf_size = with_memory ? 0 : 8;
+        trace_run(&request);
+        EXPECT_NE(log.all().find(" getppid("), std::string::npos);
+    }
+}
+
+TEST_F(TraceRun, ShowsAnEntryThatCannotBeReadAsAnExitWithoutItsNewline) {
+    static TraceBackend backend;
+    backend = native_backend();
+    backend.read_entry = [](pid_t, TraceRegisters *) { return -1; };
+    Child child([] { syscall(SYS_getppid); }, Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.attached = 1;
+    request.backend = &backend;
+    trace_run(&request);
+    for (const std::string &text : log.texts) {
+        EXPECT_NE(text.find(") = "), std::string::npos) << text;
+        EXPECT_EQ(text.find('\n'), std::string::npos) << text;
+    }
+#if defined(__x86_64__)
+    // Call 0 is one that exists: both stops of getppid and the entry of exit_group show it.
+    EXPECT_EQ(log.texts.size(), 3u);
+#endif
+}
+
+TEST_F(TraceRun, GoesOnWithoutAnyCallback) {
+    Child child([] { _exit(0); }, Child::HELD);
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = {};
+    request.pids = pids.data();
+    request.nr_pids = 1;
+    request.attached = 1;
+    request.flags = UINT32_MAX;
+    trace_run(&request);
+    EXPECT_EQ(pids[0], -1);
+    EXPECT_EQ(request.records, nullptr);
+}
+
+TEST_F(TraceRun, ComplainsOfAProcessThatCannotBeResumed) {
+    pid_t gone;
+    {
+        Child child(sleep_for_ever);
+        gone = child.pid();
+    }
+    TraceLog log;
+    std::vector<pid_t> pids = {gone};
+    TraceRequest request = request_for(&log, &pids);
+    request.attached = 1;
+    testing::internal::CaptureStdout();
+    trace_run(&request);
+    EXPECT_EQ(testing::internal::GetCapturedStdout(),
+              "PTRACE_CONT failed No such process\n"
+              "SYSCALL failed No such process\n"
+              "SYSCALL failed No such process\n"
+              "SYSCALL failed No such process\n"
+              "SYSCALL failed No such process\n"
+              "WARNING: ptrace SYSCALL failed! " +
+                  std::to_string(gone) + "\n");
+    EXPECT_EQ(pids[0], -1);
+    EXPECT_EQ(log.polls, 0);
+}
+
+// ---- The calling process ----
+
+TEST_F(TraceRun, LeavesNoDescriptorBehind) {
+    int before = open_descriptors();
+    for (int round = 0; round < 5; ++round) {
+        Child ending([] { _exit(0); }, Child::HELD);
+        Child going_on(call_for_ever, Child::HELD);
+        TraceLog log;
+        log.polls_wanted = 100;
+        std::vector<pid_t> pids = {ending.pid(), going_on.pid()};
+        TraceRequest request = request_for(&log, &pids, UINT32_MAX);
+        request.attached = 1;
+        request.timeout_s = 1000;
+        trace_run(&request);
+    }
+    EXPECT_EQ(open_descriptors(), before);
+    EXPECT_FALSE(has_children());
+}
+
+std::atomic<int> traces_seen;
+std::atomic<bool> overlapped;
+
+TEST_F(TraceRun, WaitsForATraceOfAnotherThreadToEnd) {
+    Child first(call_for_ever), second(call_for_ever);
+    static std::atomic<int> active;
+    struct Cookie {
+        int polls;
+        bool inside;
+    };
+    auto output = [](intptr_t cookie, const char *, uint32_t len) -> uint32_t {
+        Cookie *own = reinterpret_cast<Cookie *>(cookie);
+        if (!own->inside && active.fetch_add(1) != 0)
+            overlapped = true;
+        own->inside = true;
+        if (len != 0 || ++own->polls < 300)
+            return 1;
+        active.fetch_sub(1);
+        ++traces_seen;
+        return 0;
+    };
+    auto trace = [&](pid_t pid) {
+        Cookie cookie = {};
+        TraceRequest request = {};
+        request.output_cb = output;
+        request.cookie = reinterpret_cast<intptr_t>(&cookie);
+        request.pids = &pid;
+        request.nr_pids = 1;
+        trace_run(&request);
+    };
+    std::thread one(trace, first.pid()), other(trace, second.pid());
+    one.join();
+    other.join();
+    EXPECT_EQ(traces_seen, 2);
+    EXPECT_FALSE(overlapped);
+    EXPECT_TRUE(runs_free(first.pid()));
+    EXPECT_TRUE(runs_free(second.pid()));
+}
+
+}  // namespace
