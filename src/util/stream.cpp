@@ -68,6 +68,9 @@ int64_t copy_fd(int in_fd, int out_fd) {
 }
 
 uint32_t bounded_write_cb(BoundedWriter *state, const void *buf, uint32_t len) {
+    // A poll (no text) on a broken pipe succeeds, so the failure has to be remembered.
+    if (state->failed)
+        return 0;
     // A producer may hand on a failed call's -1 as its length: that is no text.
     if (len > INT32_MAX)
         len = 0;

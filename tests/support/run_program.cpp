@@ -50,8 +50,9 @@ RunResult result_of(int status) {
 }  // namespace
 
 Background::Background(const std::vector<std::string> &argv, const RunOptions &options) {
-    int in[2], out[2], err[2];
-    if (pipe2(in, O_CLOEXEC) != 0 || pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0)
+    int in[2], out[2], err[2], started[2];
+    if (pipe2(in, O_CLOEXEC) != 0 || pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0 ||
+        pipe2(started, O_CLOEXEC) != 0)
         abort();
     std::vector<std::string> words = argv;
     if (!options.argv0.empty())
@@ -75,6 +76,12 @@ Background::Background(const std::vector<std::string> &argv, const RunOptions &o
     close(in[0]);
     close(out[1]);
     close(err[1]);
+    // The last copy of its other end goes when the program begins.
+    close(started[1]);
+    char byte;
+    while (read(started[0], &byte, 1) < 0 && errno == EINTR) {
+    }
+    close(started[0]);
     in_ = in[1];
     out_ = out[0];
     err_ = err[0];

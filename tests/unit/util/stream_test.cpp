@@ -254,6 +254,7 @@ TEST_F(Stream, BoundedWriterRemembersAFailedWrite) {
     EXPECT_EQ(0u, bounded_write_cb(&writer, "x", 1));
     EXPECT_EQ(1u, writer.failed);
     EXPECT_EQ(100, writer.remaining);
+    EXPECT_EQ(0u, bounded_write_cb(&writer, "", 0)) << "the producer's polls must end it too";
 }
 
 }  // namespace
