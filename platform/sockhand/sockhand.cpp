@@ -223,7 +223,7 @@ int receive_message(int connection, void *buf, int max, int *fd) {
 
     ssize_t got;
     do {
-        got = recvmsg(connection, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+        got = recvmsg(connection, &message, MSG_CMSG_CLOEXEC);
     } while (got < 0 && errno == EINTR);
     if (got < 0)
         return -1;

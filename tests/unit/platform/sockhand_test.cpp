@@ -205,6 +205,20 @@ TEST_F(SockHand, SilentSendersHoldABoundedNumberOfDescriptors) {
     EXPECT_EQ(count_descriptors(), before) << "connections that ended are let go";
 }
 
+TEST_F(SockHand, OfSilentSendersTheOneThatCameFirstIsLetGoFirst) {
+    std::vector<int> silent;
+    for (int i = 0; i < 60; ++i) {
+        silent.push_back(connect_raw());
+        (void)receive_next();
+    }
+    send_raw(silent[40], "late", {pipe_[1]});
+    const Received received = receive_next();
+    EXPECT_EQ(received.text, "late");
+    close(received.fd);
+    for (const int fd : silent)
+        close(fd);
+}
+
 TEST_F(SockHand, ASenderThatLeavesWithoutAWordIsForgotten) {
     close(connect_raw());
     EXPECT_EQ(receive_next().length, -1);
