@@ -13,6 +13,7 @@
 
 #include <atomic>
 #include <functional>
+#include <optional>
 #include <string>
 
 #include "capture_run.h"
@@ -24,15 +25,20 @@
 
 namespace {
 
-// Makes a system call fail with `error` from now on. Says whether the machine can do that.
-bool refuse_call(unsigned number, unsigned error) {
+// Makes a system call, or only those with `third` as third argument, fail with `error` from now on.
+// Says whether the machine can do that.
+bool refuse_call(unsigned number, unsigned error, std::optional<unsigned> third = std::nullopt) {
     sock_filter code[] = {
         BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 1),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 3),
+        // The low half of the argument on these little-endian machines.
+        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, args[2])),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, third.value_or(0), 0,
+                 static_cast<uint8_t>(third ? 1 : 0)),
         BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
         BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
     };
-    sock_fprog program = {.len = 4, .filter = code};
+    sock_fprog program = {.len = 6, .filter = code};
     return prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
            prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
 }
@@ -310,6 +316,21 @@ TEST(CaptureFailure, APacketSocketThatCannotBeMadeGivesItsErrorWithoutAMessage) 
             ASSERT_EQ(0, setrlimit(RLIMIT_NOFILE, &many));
             EXPECT_EQ("", errors.text());
             EXPECT_EQ("", out.text());
+        },
+        WITH_ETH0);
+}
+
+TEST(CaptureFailure, ThePacketSocketIsMadeWithThePlainProtocolNumber3) {
+    run_in_sandbox(
+        [] {
+#ifdef __NR_socket
+            if (!refuse_call(__NR_socket, EPROTO, 3))
+                GTEST_SKIP() << "seccomp: " << strerror(errno);
+            Output out;
+            EXPECT_EQ(-EPROTO, capture_into(out.fd, {.time_limit = 1}));
+#else
+            GTEST_SKIP() << "no call of its own for socket";
+#endif
         },
         WITH_ETH0);
 }
