@@ -13,6 +13,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <set>
 
 #include "support/run_program.h"
 #include "support/temp_dir.h"
@@ -151,9 +152,12 @@ void sandbox_bind(const std::string &source, const std::string &path) {
         fs::path base = fs::path(path).parent_path();
         while (!fs::exists(base))
             base = base.parent_path();
-        // Through the links of a merged /usr, to the directory itself.
+        // Through the links of a merged /usr, to the directory itself; and once only, since a
+        // second layer would hide what is mounted in the first.
+        static std::set<fs::path> layered;
         base = fs::canonical(base);
-        sandbox_scratch(base);
+        if (layered.insert(base).second)
+            sandbox_scratch(base);
         fs::create_directories(fs::path(path).parent_path());
         if (fs::is_directory(source))
             fs::create_directory(path);
