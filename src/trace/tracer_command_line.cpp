@@ -8,6 +8,7 @@
 #include <string.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -25,16 +26,37 @@ constexpr time_t SLEEP_STEP_S = 999;
 
 std::atomic<bool> stop_flag;
 
+// Sends SIGINT again and again once one has come, until the trace has ended. The first may have
+// come just before the engine's wait, which it then did not interrupt: if the traced processes
+// sleep, nothing else would.
+timer_t repeat_timer;
+std::atomic<bool> repeating;
+constexpr itimerspec REPEAT_AFTER = {.it_interval = {.tv_sec = 0, .tv_nsec = 0},
+                                     .it_value = {.tv_sec = 0, .tv_nsec = 50 * 1000 * 1000}};
+
 void on_interrupt(int) {
+    int error = errno;
     stop_flag = true;
+    if (repeating)
+        (void)timer_settime(repeat_timer, 0, &REPEAT_AFTER, nullptr);
+    errno = error;
 }
 
 // Without SA_RESTART, so that the wait for the next event ends and the engine asks the callback.
 void catch_interrupt() {
+    sigevent event = {};
+    event.sigev_notify = SIGEV_SIGNAL;
+    event.sigev_signo = SIGINT;
+    repeating = timer_create(CLOCK_MONOTONIC, &event, &repeat_timer) == 0;
     struct sigaction action = {};
     action.sa_handler = on_interrupt;
     sigemptyset(&action.sa_mask);
     (void)sigaction(SIGINT, &action, nullptr);
+}
+
+void stop_repeating() {
+    if (repeating.exchange(false))
+        (void)timer_delete(repeat_timer);
 }
 
 // The path of `command` in `directory` if that is a regular file, else null. The slash between them
@@ -77,6 +99,7 @@ void trace_processes(TraceRequest *request, pid_t *pids, int nr_pids) {
     request->pids = pids;
     request->nr_pids = nr_pids;
     trace_run(request);
+    stop_repeating();
 }
 
 int trace_command(TraceRequest *request, char **command) {
