@@ -9,7 +9,7 @@
 
 #include <iterator>
 
-#include "util/format_at.h"
+#include "util/line_text.h"
 
 namespace {
 
@@ -73,15 +73,14 @@ Ipv4Text ipv4_at(const char *line, size_t column) {
 
 // All eight groups, each with a colon behind it, and no "::" in place of zeros: unlike the IPv4
 // form this is not what inet_ntop gives, and readers of traces rely on it.
-int format_ipv6(char *buf, size_t size, int length, const char *line, size_t column) {
+void add_ipv6(LineText *text, const char *line, size_t column) {
     for (size_t word = 0; word < 4; ++word) {
         char digits[9];
         memcpy(digits, line + column + 8 * word, 8);
         digits[8] = '\0';
         uint32_t groups = ntohl(static_cast<uint32_t>(strtoul(digits, nullptr, 16)));
-        length = format_at(buf, size, length, "%x:%x:", groups >> 16, groups & 0xffff);
+        text->add("%x:%x:", groups >> 16, groups & 0xffff);
     }
-    return length;
 }
 
 }  // namespace
@@ -90,26 +89,27 @@ int match_tcp_line(const char *line, unsigned long inode, char *buf, size_t size
     const TcpColumns &columns = TCP_COLUMNS;
     if (!inode_at(line, columns.inode, inode))
         return NO_MATCH;
-    return format_at(buf, size, 0, "[%s:%d -> %s:%d][%s]",
-                     ipv4_at(line, columns.local_address).text,
-                     static_cast<int>(hex_at(line, columns.local_port)),
-                     ipv4_at(line, columns.remote_address).text,
-                     static_cast<int>(hex_at(line, columns.remote_port)),
-                     tcp_state_name(hex_at(line, columns.state)).text);
+    LineText text(buf, size);
+    text.add("[%s:%d -> %s:%d][%s]", ipv4_at(line, columns.local_address).text,
+             static_cast<int>(hex_at(line, columns.local_port)),
+             ipv4_at(line, columns.remote_address).text,
+             static_cast<int>(hex_at(line, columns.remote_port)),
+             tcp_state_name(hex_at(line, columns.state)).text);
+    return text.length();
 }
 
 int match_tcp6_line(const char *line, unsigned long inode, char *buf, size_t size) {
     const TcpColumns &columns = TCP6_COLUMNS;
     if (!inode_at(line, columns.inode, inode))
         return NO_MATCH;
-    int length = format_at(buf, size, 0, "[");
-    length = format_ipv6(buf, size, length, line, columns.local_address);
-    length =
-        format_at(buf, size, length, "%d -> ", static_cast<int>(hex_at(line, columns.local_port)));
-    length = format_ipv6(buf, size, length, line, columns.remote_address);
-    return format_at(buf, size, length, "%d][%s]",
-                     static_cast<int>(hex_at(line, columns.remote_port)),
-                     tcp_state_name(hex_at(line, columns.state)).text);
+    LineText text(buf, size);
+    text.add("[");
+    add_ipv6(&text, line, columns.local_address);
+    text.add("%d -> ", static_cast<int>(hex_at(line, columns.local_port)));
+    add_ipv6(&text, line, columns.remote_address);
+    text.add("%d][%s]", static_cast<int>(hex_at(line, columns.remote_port)),
+             tcp_state_name(hex_at(line, columns.state)).text);
+    return text.length();
 }
 
 int match_unix_line(const char *line, unsigned long inode, char *buf, size_t size) {
@@ -127,5 +127,7 @@ int match_unix_line(const char *line, unsigned long inode, char *buf, size_t siz
     if (*end == '\n' || *end == '\0')
         return 0;
     const char *path = end + 1;
-    return format_at(buf, size, 0, "[%.*s]", static_cast<int>(strcspn(path, "\n")), path);
+    LineText text(buf, size);
+    text.add("[%.*s]", static_cast<int>(strcspn(path, "\n")), path);
+    return text.length();
 }

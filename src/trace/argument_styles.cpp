@@ -8,7 +8,7 @@
 #include <unistd.h>
 
 #include "proc/descriptors.h"
-#include "trace/line_text.h"
+#include "util/line_text.h"
 #include "util/stream.h"
 #include "util/unique_fd.h"
 

@@ -7,7 +7,7 @@
 #include <iterator>
 
 #include "trace/argument_styles.h"
-#include "trace/line_text.h"
+#include "util/line_text.h"
 
 namespace {
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "unit/trace/guarded_buffer.h"
+#include "support/guarded_buffer.h"
 #include "unit/trace/made_up_mips_kernel.h"
 #include "util/unique_fd.h"
 

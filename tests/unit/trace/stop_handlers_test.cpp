@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "unit/trace/guarded_buffer.h"
+#include "support/guarded_buffer.h"
 #include "unit/trace/made_up_mips_kernel.h"
 
 namespace {

@@ -1,8 +1,8 @@
-#include "trace/line_text.h"
+#include "util/line_text.h"
 
 #include <gtest/gtest.h>
 
-#include "unit/trace/guarded_buffer.h"
+#include "support/guarded_buffer.h"
 
 TEST(LineText, AddsPieceAfterPiece) {
     char buf[32];
