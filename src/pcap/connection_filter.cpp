@@ -30,9 +30,9 @@ struct PortPairs {
     uint32_t from_peer;
 };
 
-// Only the port pairs are compared, not the addresses, nor whether it is TCP or a later fragment.
-// This stays so: a few frames too many are hidden, but none of the connection's is ever shown, and
-// the program is short enough to be read in a listing of the attached filters.
+// Deliberately narrow: only the port pairs are compared, not the addresses, the protocol or the
+// fragment offset. A few frames too many are hidden, which is kept: what a capture leaves out must
+// not change between versions.
 unsigned fill_ipv4(const PortPairs &ports, Program *program) {
     const sock_filter code[] = {
         BPF_STMT(BPF_LD | BPF_H | BPF_ABS, ETHER_TYPE_AT),
