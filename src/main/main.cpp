@@ -5,6 +5,7 @@
 
 #include "cgi/debugar.h"
 #include "main/fault_applets.h"
+#include "oops/oopslog.h"
 #include "pcap/pcapdump.h"
 #include "trace/tracer_applets.h"
 
