@@ -22,10 +22,10 @@ class Snapcore : public testing::Test {
             GTEST_SKIP() << "there is no gdb here, which writes the cores";
     }
 
-    static RunResult run(const std::string &pid, const std::string &output = "/dev/stdout") {
+    static RunResult run(const std::string &pid, const std::string &program = snapcore()) {
         RunOptions options;
         options.before_exec = [] { clearenv(); };
-        return run_program({snapcore(), "-c", output, pid}, options);
+        return run_program({program, "-c", "/dev/stdout", pid}, options);
     }
 };
 
@@ -111,9 +111,11 @@ TEST_F(Snapcore, AProcessThatIsTracedAlreadyHasNoCoreAndRunsOn) {
 
 TEST_F(Snapcore, AFullDiskGivesNoHalfCore) {
     run_in_sandbox([] {
+        // The sources may lie below /tmp.
+        sandbox_shell("cp " + snapcore() + " /run/snapcore");
         sandbox_shell("mount -t tmpfs -o size=64k tmpfs /tmp");
         Echo target;
-        const RunResult result = run(target.pid());
+        const RunResult result = run(target.pid(), "/run/snapcore");
         EXPECT_EQ(1, result.exit_status);
         EXPECT_EQ("", result.out);
         EXPECT_EQ("core is 0 bytes long, holding " + target.pid() + "\n", result.err);
