@@ -9,8 +9,8 @@
 
 namespace {
 
-// Argument `index` as a decimal, "0x" hexadecimal or leading-"0" octal number, 0 for any other
-// text; `absent` when there is no such argument.
+// Argument `index` as strtoul reads it, in decimal, "0x" hexadecimal or leading-"0" octal form, 0
+// for text that is no number; `absent` when there is no such argument.
 unsigned long number_argument(int argc, char **argv, int index, unsigned long absent) {
     return index < argc ? strtoul(argv[index], nullptr, 0) : absent;
 }
@@ -55,14 +55,14 @@ int run_forkbomb(int argc, char **argv) {
 
 int run_fdleak(int argc, char **argv) {
     unsigned long delay_us = number_argument(argc, argv, 1, 0);
-    setlinebuf(stdout);
+    setlinebuf(stdout);  // its progress is to be seen, also through a pipe
     for (uint64_t n = 0;;) {
         int fd = n % 2 == 0 ? socket(AF_INET, SOCK_STREAM, 0) : open("/dev/null", O_RDONLY);
         if (fd == -1) {
-            perror("open");
+            perror("open");  // of whichever kind: one line to look for
             exit(0);
         }
-        usleep(static_cast<useconds_t>(delay_us));
+        usleep(static_cast<useconds_t>(delay_us));  // of 0, too: it gives way to others
         if (++n % 16 == 0)
             printf("leaked %" PRIu64 "\n", n);
     }

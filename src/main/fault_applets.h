@@ -10,8 +10,8 @@ int run_ctest(int argc, char **argv);
 int run_forkbomb(int argc, char **argv);
 
 // `fdleak [DELAY_US]`: opens a TCP socket and /dev/null in turn, with a pause of DELAY_US
-// microseconds (0) after each, and never closes them. Prints "leaked N" after every 16th. Returns 0
-// once no more can be opened, with "open: ..." on standard error.
+// microseconds (0) after each, and never closes them. Prints "leaked N" after every 16th. Ends the
+// process with 0 once no more can be opened, with "open: ..." on standard error.
 int run_fdleak(int argc, char **argv);
 
 // `segfault`: dies of SIGSEGV.

@@ -79,6 +79,10 @@ int report_failure(const char *what) {
 
 // Returns the socket, or the negated error number with the failure printed.
 int open_packet_socket(const char *interface, const sock_fprog *filter) {
+    // An unknown name gives 0, which stands for all interfaces. Looking it up takes a descriptor
+    // for a moment, so it comes first: the last free one would otherwise be the socket's, and the
+    // capture that of all interfaces.
+    const unsigned index = if_nametoindex(interface);
     UniqueFd ret(socket(AF_PACKET, SOCK_RAW | SOCK_CLOEXEC, UNBOUND_PROTOCOL));
     if (!ret.valid())
         return -errno;
@@ -86,8 +90,7 @@ int open_packet_socket(const char *interface, const sock_fprog *filter) {
     sockaddr_ll address = {};
     address.sll_family = AF_PACKET;
     address.sll_protocol = htons(ETH_P_ALL);
-    // An unknown name gives 0, which stands for all interfaces.
-    address.sll_ifindex = static_cast<int>(if_nametoindex(interface));
+    address.sll_ifindex = static_cast<int>(index);
     if (bind(ret.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address) < 0)
         return report_failure("bind");
     if (filter != nullptr &&

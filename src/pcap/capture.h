@@ -7,7 +7,7 @@
 // Captures on `interface` (an unknown name: on all) into `out_fd`, which stays the caller's, until
 //
 //   - `time_limit` seconds have passed (0: no limit),
-//   - the next frame might take the stream beyond `size_limit` bytes (0: no limit),
+//   - the next frame would leave too little of `size_limit` bytes for a filler (0: no limit),
 //   - the interface fails, for instance because it went down, or,
 //   - with neither limit, the reader of `out_fd`, a socket, has closed its end.
 //

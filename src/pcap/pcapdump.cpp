@@ -10,8 +10,8 @@
 
 namespace {
 
-// As good as no limit, and not 0: without any limit the capture would take the end of its output,
-// which a file is always at, for a client that has gone.
+// As good as no limit, and not 0: without any limit the capture would take an output that it cannot
+// read from, as this file, for a client that has gone.
 constexpr uint32_t TIME_LIMIT_S = 2147483647;
 
 }  // namespace

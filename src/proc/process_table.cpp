@@ -1,6 +1,7 @@
 #include "proc/process_table.h"
 
 #include <ctype.h>
+#include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -52,14 +53,14 @@ struct DescriptorCounts {
 void count_target(const char *target, DescriptorCounts *counts) {
     if (strncmp(target, "socket:[", 8) == 0)
         ++counts->sockets;
-    // A comparison of the whole target, which always has a number behind the bracket: pipes are not
-    // counted, and the scores that are built on these counts are balanced for that.
+    // A comparison of the whole target, which always has a number behind the bracket, so no pipe is
+    // ever counted. It stays: whoever weighs these counts has always seen 0 there.
     else if (strcmp(target, "pipe:[") == 0)
         ++counts->pipes;
 }
 
-// Counts the descriptors in `dir` from where it stands. Returns false when a link could not be
-// read, because the descriptor was closed meanwhile.
+// Counts the descriptors in `dir` from where it stands. Returns false when one of them was closed
+// meanwhile.
 bool count_entries(DIR *dir, bool read_links, DescriptorCounts *counts) {
     while (const dirent *entry = readdir(dir)) {
         if (entry->d_name[0] == '.')
@@ -69,9 +70,10 @@ bool count_entries(DIR *dir, bool read_links, DescriptorCounts *counts) {
             continue;
         char target[128];
         ssize_t n = readlinkat(dirfd(dir), entry->d_name, target, sizeof target - 1);
-        if (n < 0)
+        if (n < 0 && errno == ENOENT)
             return false;
-        target[n] = '\0';
+        // Links that may not be read stay so: beginning again for them would never end.
+        target[n > 0 ? n : 0] = '\0';
         count_target(target, counts);
     }
     return true;
@@ -105,6 +107,8 @@ bool name_from_stat(char *text) {
 }
 
 pid_t ppid_from_stat(const char *text) {
+    // The fields are counted as they come, parentheses or not: what follows from a name with a
+    // blank in it is part of what callers expect of this number.
     for (int field = 1; field < 4; ++field) {
         while (*text != '\0' && !isspace(static_cast<unsigned char>(*text)))
             ++text;
@@ -211,8 +215,8 @@ int count_fds(pid_t pid, int *sockets, int *pipes) {
             counts = {};
             break;
         }
-        // Begun again, what had been counted so far stays: a table that changes so fast is busy,
-        // and an estimate on the high side draws the eye to it.
+        // Begun again, what had been counted so far stays and is counted once more: callers know
+        // the count of a busy table as one on the high side.
         complete = count_entries(dir.get(), read_links, &counts);
     } while (!complete);
     if (sockets != nullptr)

@@ -50,7 +50,8 @@ pid_t proc_ppid(pid_t pid);
 void find_pids_by_name(const char *root, const char *name, pid_t *pids, int *count, int capacity);
 
 // Returns the number of open descriptors of `pid`, and stores in `sockets` and `pipes`, either of
-// which may be null, how many of them are sockets and pipes. All are 0 when they cannot be listed.
+// which may be null, how many of them are sockets and pipes. (The latter is always 0: see
+// the source.) All are 0 when they cannot be listed.
 int count_fds(pid_t pid, int *sockets, int *pipes);
 
 // The parsing behind them, on terminated texts.

@@ -10,8 +10,8 @@
 
 namespace {
 
-// Makes `given` the child's descriptor `standard`. The calls may fail without harm: the program then
-// starts with that descriptor closed, as it would find it for itself.
+// Makes `given` the child's descriptor `standard`. The calls may fail without harm: the program
+// then starts with that descriptor closed, as it would find it for itself.
 void redirect(int given, int standard) {
     if (given == standard) {
         (void)fcntl(standard, F_SETFD, 0);  // to be kept over the execve, whatever it was before

@@ -19,8 +19,9 @@ pid_t spawn_process(const char *path, char *const argv[], char *const envp[], in
 pid_t spawn_process_noenv(const char *path, char *const argv[], int in_fd, int out_fd, int err_fd,
                           bool trace_me);
 
-// Starts `path` with an empty environment, waits for its end and returns bits 8 to 15 of its wait
-// status: the exit code, or 0 for a child that a signal killed. Also 0 when the wait fails.
+// Starts `path` with an empty environment, waits for it once and returns bits 8 to 15 of its wait
+// status: the exit code, or 0 for a child that a signal killed (with `trace_me`: the signal of its
+// first stop). Also 0 when it cannot be started or waited for.
 int run_process_wait(const char *path, char *const argv[], int in_fd, int out_fd, int err_fd,
                      bool trace_me);
 

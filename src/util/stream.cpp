@@ -9,6 +9,8 @@ namespace {
 
 constexpr uint32_t COPY_BLOCK = 16384;
 
+// At once and without end, a full non-blocking descriptor included: the toolbox writes to blocking
+// ones, and giving up would cut its output.
 bool worth_retrying(int error) {
     return error == EINTR || error == EAGAIN;
 }

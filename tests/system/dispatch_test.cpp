@@ -31,6 +31,12 @@ TEST(Dispatcher, LooksItsOwnNameUpOnlyOnce) {
     }
 }
 
+TEST(Dispatcher, UnderItsOwnNameWithItsOwnNameAsTheOnlyArgumentKnowsNoSuchApplet) {
+    RunResult result = run_fieldkit({"fieldkit"});
+    EXPECT_EQ(1, result.exit_status);
+    EXPECT_EQ("fieldkit: unknown fieldkit applet\n", result.out);
+}
+
 TEST(Dispatcher, NamesAnUnknownApplet) {
     for (const char *name : {"nosuch", "/some/dir/nosuch"}) {
         RunResult result = run_fieldkit({name});
@@ -77,13 +83,21 @@ TEST(Dispatcher, IgnoresABrokenPipeInEveryApplet) {
     int ends[2];
     ASSERT_EQ(0, pipe(ends));
     close(ends[0]);
-    RunResult result = run_program({fieldkit_path(), "ctest"}, {.before_exec = [&] {
-                                       signal(SIGPIPE, SIG_DFL);
-                                       dup2(ends[1], 1);
-                                   }});
+    RunOptions options;
+    options.before_exec = [&] {
+        signal(SIGPIPE, SIG_DFL);
+        dup2(ends[1], 1);
+        for (int fd = 3; fd < 1000; ++fd)
+            close(fd);
+        rlimit tight = {40, 40};
+        setrlimit(RLIMIT_NOFILE, &tight);
+    };
+    const std::vector<std::string> applets[] = {
+        {"ctest"},   {"fdleak"},           {"pcapdump"}, {"tstrace"}, {"tstrace", "/bin/true"},
+        {"stopper"}, {"debugar.cgi", "-h"}};
+    for (const std::vector<std::string> &applet : applets)
+        EXPECT_EQ(0, run_fieldkit(applet, options).signal) << applet[0];
     close(ends[1]);
-    EXPECT_EQ(0, result.signal);
-    EXPECT_EQ(0, result.exit_status);
 }
 
 TEST(Ctest, PrintsOneLineAndExitsWithZero) {
@@ -187,7 +201,7 @@ TEST(Forkbomb, CountsItsForksFromOneAndEveryChildSpinsAtOnce) {
     });
 }
 
-TEST(Forkbomb, WithoutArgumentsForksWithoutPause) {
+TEST(Forkbomb, WithoutArgumentsForksWithoutPauseAndEveryChildSpins) {
     run_in_sandbox([] {
         // A limit, so that the machine lives: further forks fail silently and are counted as well.
         RunOptions options;
@@ -199,6 +213,11 @@ TEST(Forkbomb, WithoutArgumentsForksWithoutPause) {
         Background bomb({fieldkit_path(), "forkbomb"}, options);
         for (int i = 1; i <= 200; ++i)
             EXPECT_EQ("forks " + std::to_string(i), bomb.read_line());
+        bomb.send_signal(SIGSTOP);
+        EXPECT_TRUE(wait_until([] {
+            Herd herd = count_herd();
+            return herd.all >= 4 && herd.running == herd.all - 1;
+        }));
     });
 }
 

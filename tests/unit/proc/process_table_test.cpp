@@ -2,9 +2,11 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/capability.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 
 #include <algorithm>
@@ -78,6 +80,19 @@ struct FakeProc {
 
 const std::string NUL(1, '\0');
 
+// Gives up a capability of this process.
+bool drop_from_permitted(unsigned capability) {
+    __user_cap_header_struct header = {_LINUX_CAPABILITY_VERSION_3, 0};
+    __user_cap_data_struct data[2];
+    if (syscall(SYS_capget, &header, data) != 0)
+        return false;
+    uint32_t mask = ~(1u << capability % 32);
+    data[capability / 32].effective &= mask;
+    data[capability / 32].permitted &= mask;
+    data[capability / 32].inheritable &= mask;
+    return syscall(SYS_capset, &header, data) == 0;
+}
+
 // What list_pids gives, in order.
 std::vector<pid_t> sorted_pids(pid_t exclude) {
     std::vector<pid_t> pids(100);
@@ -132,11 +147,13 @@ TEST(ProcName, OfAProcessStartedWithAPathIsItsLastComponentAndOfABareNameComesFr
     proc.process(11, "app" + NUL, "11 (statname) S 1");
     proc.process(12, "", "12 (kthread) S 1");
     proc.process(13, "", "");
+    proc.process(14, "", "14 (a) (b) S 1");
     EXPECT_EQ("app", proc.name(10));
     EXPECT_EQ("statname", proc.name(11));
     EXPECT_EQ("kthread", proc.name(12));
     EXPECT_EQ("(none)", proc.name(13));
-    EXPECT_EQ("(none)", proc.name(14));
+    EXPECT_EQ("b", proc.name(14));
+    EXPECT_EQ("(none)", proc.name(15));
 }
 
 TEST(ProcName, DoesNotReadWhatTheBufferHeldBefore) {
@@ -310,6 +327,26 @@ TEST(CountFds, OfAProcessThatHasGoneIsZeroThroughout) {
     EXPECT_EQ(0, count_fds(0x7fffffff, &sockets, &pipes));
     EXPECT_EQ(0, sockets);
     EXPECT_EQ(0, pipes);
+}
+
+TEST(CountFds, CountsDescriptorsWhoseLinksMayNotBeRead) {
+    run_in_sandbox([] {
+        // /proc/PID/fd is open to root, but its links only to those who might trace the process.
+        Child child;
+        pid_t looker = fork();
+        if (looker == 0) {
+            if (prctl(PR_CAPBSET_DROP, CAP_SYS_PTRACE) != 0 || !drop_from_permitted(CAP_SYS_PTRACE))
+                _exit(77);
+            int sockets = -1, pipes = -1;
+            int total = count_fds(child.pid(), &sockets, &pipes);
+            _exit(total >= 3 && sockets == 0 && pipes == 0 ? 0 : 1);
+        }
+        int status;
+        waitpid(looker, &status, 0);
+        if (WEXITSTATUS(status) == 77)
+            GTEST_SKIP() << "no capability to give up here";
+        EXPECT_EQ(0, status);
+    });
 }
 
 TEST(CountFds, SurvivesDescriptorsThatComeAndGo) {
