@@ -20,7 +20,8 @@ constexpr int COMPRESSION_LEVEL = 1;
 constexpr int WINDOW_BITS = -15;  // raw deflate: the gzip framing is ours
 constexpr int MEMORY_LEVEL = 8;
 
-// ID1, ID2, deflate, no flags, no time, no extra flags, Unix (RFC 1952).
+// ID1, ID2, deflate, no flags, no time, no extra flags, Unix (RFC 1952). The extra flags could tell
+// of the fastest level, but these bytes are fixed: readers compare them.
 constexpr unsigned char GZIP_HEADER[10] = {0x1f, 0x8b, 8, 0, 0, 0, 0, 0, 0, 3};
 
 struct Compressor {
@@ -105,7 +106,7 @@ void gzip_filter() {
     c.size = 0;
     (void)deflateInit2(&c.stream, COMPRESSION_LEVEL, Z_DEFLATED, WINDOW_BITS, MEMORY_LEVEL,
                        Z_DEFAULT_STRATEGY);
-    // With the pipe closed as well, whoever fills it learns that nobody wants the archive any more.
+    // Nothing more will be read.
     if (!compress_all(&c))
         (void)close(STDIN_FILENO);
     (void)deflateEnd(&c.stream);

@@ -6,6 +6,7 @@
 LocalStamp local_stamp() {
     time_t now = time(nullptr);
     tm local = {};
+    tzset();  // the zone may have changed since the last time; localtime_r would not look
     (void)localtime_r(&now, &local);
     LocalStamp stamp;
     (void)snprintf(stamp.text, sizeof stamp.text, "%4.4d%2.2d%2.2d-%2.2d%2.2d%2.2d",

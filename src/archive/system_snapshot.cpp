@@ -87,6 +87,7 @@ int add_strace_log(TarWriter *tw, pid_t *pids, int count) {
 }
 
 void write_space_lines(int fd, int32_t n) {
+    // Blanks and not zeros, so that the log stays a text.
     char line[80];
     memset(line, ' ', sizeof line);
     line[sizeof line - 1] = '\n';

@@ -28,8 +28,8 @@ int tar_add_open_file(TarWriter *tw, int fd, const char *name, int source, int64
         return 1;
     if (fill && copied < size)
         (void)write_zeros(fd, size - copied);
-    // The zeros are left out of the account on purpose: readers of these archives know the padding
-    // that follows from it, and it must stay as it is.
+    // The zeros are left out of the account on purpose, and with them from the padding that
+    // follows: the layout of such a member is kept as it has always been.
     tar_account(tw, static_cast<uint32_t>(copied));
     return 0;
 }
@@ -62,5 +62,6 @@ int add_command_output(TarWriter *tw, int fd, const char *member, char *const ar
     struct stat status;
     if (fstat(output.get(), &status) != 0)
         return 0;
+    // No fill: the file does not change any more.
     return tar_add_open_file(tw, fd, member, output.get(), status.st_size, false);
 }

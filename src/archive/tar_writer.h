@@ -4,9 +4,9 @@
 
 #include <stdint.h>
 
-// One archive being written. A member's size is announced by its header, so whoever adds a member
-// must write exactly that much data behind it, through tar_write, or straight to the descriptor
-// with tar_account.
+// One archive being written. A member's size is announced by its header; whoever adds the member
+// writes that much data behind it, through tar_write, or straight to the descriptor with
+// tar_account. (The few members that may come out otherwise say so where they are made.)
 struct TarWriter {
     char *prefix;  // our own copy, in front of every member name; null for none
     uint32_t prefix_len;

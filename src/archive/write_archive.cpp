@@ -2,6 +2,8 @@
 
 #include <stdio.h>
 
+#include <algorithm>
+
 #include "archive/local_stamp.h"
 #include "archive/proc_snapshot.h"
 #include "archive/process_snapshot.h"
@@ -42,7 +44,11 @@ int add_proc(Assembly *a) {
 }
 
 int add_trace(Assembly *a) {
-    return add_strace_log(a->tw, a->pids, a->nr_pids);
+    // On a copy: what cannot be traced (kernel threads, say) or ends meanwhile is still
+    // snapshotted, or said to have gone.
+    pid_t pids[MAX_PIDS];
+    std::copy_n(a->pids, a->nr_pids, pids);
+    return add_strace_log(a->tw, pids, a->nr_pids);
 }
 
 int add_capture(Assembly *a) {

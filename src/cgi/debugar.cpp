@@ -18,11 +18,12 @@ Settings settings;
 int devnull_fd = -1;
 
 // Writes one archive to what is standard output now. Standard output itself becomes standard error,
-// so that a complaint which the tracer prints cannot land in the middle of the archive.
+// so that a complaint which the tracer prints cannot land in the middle of the archive; and no
+// program that a collector starts gets hold of the archive's descriptor.
 void dump_archive() {
-    UniqueFd out(dup(STDOUT_FILENO));
+    UniqueFd out(fcntl(STDOUT_FILENO, F_DUPFD_CLOEXEC, 0));
     if (!out.valid()) {
-        perror("dup");
+        perror("standard output");
         return;
     }
     (void)dup2(STDERR_FILENO, STDOUT_FILENO);
@@ -40,6 +41,7 @@ int run_debugar(int argc, char **argv) {
     if (parse_settings(argc, argv, &settings, &ignore_pid) != 0)
         return 1;
     set_ignore_pid(ignore_pid);
+    // Without it nothing is lost: what would be thrown away cannot be written then, either.
     devnull_fd = open("/dev/null", O_RDWR);
     set_core_program(settings.core_program, devnull_fd);
     if (settings.dump_mode) {

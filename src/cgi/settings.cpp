@@ -6,6 +6,7 @@
 
 namespace {
 
+// The "[pids...]" are not read, and "-k" is not told: the text is older than both.
 constexpr char USAGE[] =
     "dbg-cgi 0.1\n"
     "dbg-cgi [options] [pids...]\n"
@@ -21,7 +22,7 @@ constexpr char USAGE[] =
 }  // namespace
 
 int parse_settings(int argc, char **argv, Settings *settings, pid_t *ignore_pid) {
-    // "-h" has no case of its own: help is asked for like any mistake is answered, with status 1.
+    // "-h" has no case of its own: a request for help is answered like a mistake, with status 1.
     for (int option; (option = getopt(argc, argv, "di:np:s:c:k:ht")) != -1;) {
         switch (option) {
             case 'd':

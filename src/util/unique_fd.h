@@ -8,8 +8,7 @@
 #include <memory>
 #include <utility>
 
-// Owns one descriptor, or none (-1). Closing errors are ignored: nothing is ever written through
-// an owner without the write itself having been checked.
+// Owns one descriptor, or none (-1). Closing errors are ignored: what matters shows in the writes.
 class UniqueFd {
   public:
     UniqueFd() = default;

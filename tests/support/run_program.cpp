@@ -149,6 +149,13 @@ void Background::close_input() {
     in_ = -1;
 }
 
+void Background::close_output() {
+    if (out_ >= 0)
+        close(out_);
+    out_ = -1;
+    pending_.clear();
+}
+
 void Background::send_signal(int signo) {
     ASSERT_GT(pid_, 0);
     kill(pid_, signo);

@@ -44,6 +44,8 @@ class Background {
     // Writes to its standard input.
     void write_input(const std::string &text);
     void close_input();
+    // Stops reading its standard output.
+    void close_output();
     void send_signal(int signo);
     // Waits for its end and returns everything that it wrote meanwhile.
     RunResult wait(int timeout_s = 60);

@@ -74,6 +74,17 @@ std::vector<std::string> outline(const std::vector<TarMember> &members) {
     return result;
 }
 
+// The same without the kernel's memory image, which has its place behind "oopslog" on a machine
+// with little memory.
+std::vector<std::string> without_kcore(std::vector<std::string> names) {
+    auto kcore = std::find(names.begin(), names.end(), "kcore");
+    if (kcore == names.end())
+        return names;
+    EXPECT_EQ("oopslog", *(kcore - 1));
+    names.erase(kcore);
+    return names;
+}
+
 std::string directory_of(pid_t pid, const char *name) {
     return std::string(name) + "." + std::to_string(pid) + "/";
 }
@@ -94,16 +105,11 @@ TEST(Archive, HoldsEveryMemberInOrder) {
             EXPECT_EQ(0, result.exit_status);
             std::vector<TarMember> members = read_tar(result.out);
             std::string process = directory_of(sleeper.pid(), "sleep");
-            std::vector<std::string> expected = {
-                "dbg-monitor.txt", "media.conf",         "proc.DATE-TIME/...", "proc/...",
-                "strace.log",      "netdump.cap",        "healthsheet.txt",    "oopslog",
-                "kcore",           "proc.DATE-TIME/...", "proc/...",           process + "core",
-                process + "fdmap"};
-            // Few machines have so little memory.
-            struct stat kcore;
-            if (stat("/proc/kcore", &kcore) != 0 || kcore.st_size > 10485760)
-                expected.erase(expected.begin() + 8);
-            EXPECT_EQ(expected, outline(members));
+            EXPECT_EQ((std::vector<std::string>{
+                          "dbg-monitor.txt", "media.conf", "proc.DATE-TIME/...", "proc/...",
+                          "strace.log", "netdump.cap", "healthsheet.txt", "oopslog",
+                          "proc.DATE-TIME/...", "proc/...", process + "core", process + "fdmap"}),
+                      without_kcore(outline(members)));
 
             std::string top = members.at(0).name.substr(0, members[0].name.find('/') + 1);
             EXPECT_EQ("debug-", top.substr(0, 6));
@@ -126,21 +132,19 @@ TEST(Archive, HoldsEveryMemberInOrder) {
         WITH_ETH0);
 }
 
-TEST(Archive, InItsGzipFormHoldsTheSameWithoutTheCompressor) {
+TEST(Archive, InItsGzipFormHoldsTheSameMembersWithoutTheCompressor) {
     run_in_sandbox(
         [] {
             TempDir dir;
             Background sleeper({"/bin/sleep", "1000"});
             RunResult result = run_fieldkit({"debugar.cgi", "-d", "-p", core_writer(dir)});
             EXPECT_EQ(0, result.exit_status);
-            std::vector<TarMember> members = read_tar(gunzip(result.out));
-            std::vector<std::string> names = outline(members);
             std::string process = directory_of(sleeper.pid(), "sleep");
-            ASSERT_GT(names.size(), 4u);
-            EXPECT_EQ(process + "core", names[names.size() - 2]);
-            EXPECT_EQ(process + "fdmap", names[names.size() - 1]);
-            for (const std::string &name : names)
-                EXPECT_EQ(std::string::npos, name.find("fieldkit")) << name;
+            EXPECT_EQ((std::vector<std::string>{"proc.DATE-TIME/...", "proc/...", "strace.log",
+                                                "netdump.cap", "healthsheet.txt", "oopslog",
+                                                "proc.DATE-TIME/...", "proc/...", process + "core",
+                                                process + "fdmap"}),
+                      without_kcore(outline(read_tar(gunzip(result.out)))));
         },
         WITH_ETH0);
 }
@@ -214,6 +218,11 @@ TEST(Archive, WithoutASleepProgramHasATraceThatEndsAtOnce) {
         EXPECT_EQ(0, result.exit_status);
         EXPECT_NE(std::string::npos, result.err.find("execve: "));
         std::vector<TarMember> members = read_tar(result.out);
+        std::string top = members.at(0).name.substr(0, members[0].name.find('/') + 1);
+        // Its descriptors are listed, as at the end of every trace, but there was no time for more.
+        std::string log = find_member(members, top + "strace.log")->data;
+        EXPECT_NE(std::string::npos, log.find(" open fds:\n"));
+        EXPECT_EQ(std::string::npos, log.find(") = "));
         EXPECT_TRUE(runs_untraced(sleeper.pid())) << state_of(sleeper.pid());
     });
 }
@@ -281,23 +290,54 @@ void expect_nothing_left(const Background &sleeper) {
     EXPECT_TRUE(runs_untraced(sleeper.pid())) << state_of(sleeper.pid());
 }
 
-TEST(Archive, EndsQuietlyWhenItsReaderGoesAwayDuringTheTrace) {
+TEST(Archive, EndsQuietlyWhenItsReaderGoesAwayDuringTheFirstSnapshot) {
     for (const char *form : {"-d", "-dt"}) {
         run_in_sandbox([form] {
             Background sleeper({"/bin/sleep", "1000"});
-            {
-                Background busy({"/bin/sh", "-c", "while :; do echo text; done >/dev/null"});
-                RunResult result = run_program({"/bin/sh", "-c",
-                                                "{ " + fieldkit_path() + " debugar.cgi " + form +
-                                                    " -p /nonexistent; echo $? >&2; } | "
-                                                    "head -c 20000 | wc -c"});
-                EXPECT_EQ("20000\n", result.out);
-                EXPECT_EQ("0\n", result.err.substr(result.err.size() - 2)) << result.err;
-                EXPECT_EQ(std::string::npos, result.err.find("healthsheet"));
-            }
+            RunResult result =
+                run_program({"/bin/sh", "-c",
+                             "{ " + fieldkit_path() + " debugar.cgi " + form +
+                                 " -p /nonexistent; echo $? >&2; } | head -c 20000 | wc -c"});
+            EXPECT_EQ("20000\n", result.out);
+            EXPECT_EQ("0\n", result.err.substr(result.err.size() - 2)) << result.err;
             expect_nothing_left(sleeper);
         });
     }
+}
+
+TEST(Archive, EndsQuietlyWhenItsReaderGoesAwayDuringTheTrace) {
+    run_in_sandbox([] {
+        Background sleeper({"/bin/sleep", "1000"});
+        {
+            Background busy({"/bin/sh", "-c", "while :; do echo text; done >/dev/null"});
+            Background archive({fieldkit_path(), "debugar.cgi", "-dt", "-p", "/nonexistent"});
+            std::string line;
+            do {
+                line = archive.read_line();
+            } while (line.find("\"text\\n\", 5) = 5") == std::string::npos &&
+                     !testing::Test::HasFailure());
+            archive.close_output();
+            EXPECT_EQ(0, archive.wait(4).exit_status);
+        }
+        expect_nothing_left(sleeper);
+    });
+}
+
+TEST(Archive, GivesItsOutputToNoProgramThatItStarts) {
+    run_in_sandbox([] {
+        TempDir dir;
+        // One that lives on, and would keep the archive's reader waiting.
+        sandbox_bind(
+            dir.file("sheet", "#!/bin/sh\n/bin/sleep 1000 </dev/null >/dev/null 2>&1 &\n", 0755),
+            "/usr/sbin/gen_healthsheet.sh");
+        for (const char *form : {"-d", "-dt"}) {
+            RunResult result = run_program(
+                {"/bin/sh", "-c",
+                 fieldkit_path() + " debugar.cgi " + form + " -p /nonexistent | tail -c 1 | wc -c"},
+                {.timeout_s = 40});
+            EXPECT_EQ("1\n", result.out);
+        }
+    });
 }
 
 TEST(Archive, EndsQuietlyOnAFullDisk) {

@@ -133,16 +133,19 @@ TEST_F(Snapshot, TakesAControlLineOf256Bytes) {
 }
 
 TEST_F(Snapshot, WarnsOfAShortCoreAndLeavesItShort) {
-    script("control 2000 $3; printf 0123456789; echo more on the control pipe >&2");
+    // More than the pipe holds, so that the control line has been read before there is another.
+    script(
+        "control 200010 $3; head -c 199950 /dev/zero | tr '\\0' x; echo more on the control pipe "
+        ">&2");
     EXPECT_EQ(0, take({getpid()}));
-    EXPECT_EQ("WARNING: err=10 clen=2000 pid=" + std::to_string(getpid()) +
+    EXPECT_EQ("WARNING: err=199950 clen=200010 pid=" + std::to_string(getpid()) +
                   "\nmore on the control pipe\n",
               errors_);
     std::string bytes = archive_.bytes();
-    EXPECT_EQ("00000003720", bytes.substr(124, 11));
-    EXPECT_EQ("0123456789", bytes.substr(512, 10));
-    // Padded as 2000 bytes are, to the header of the descriptor map.
-    EXPECT_EQ(own_dir() + "fdmap", bytes.substr(512 + 10 + 48, 100).c_str());
+    EXPECT_EQ("00000606512", bytes.substr(124, 11));
+    EXPECT_EQ(std::string(199950, 'x'), bytes.substr(512, 199950));
+    // Padded as 200010 bytes are, to the header of the descriptor map.
+    EXPECT_EQ(own_dir() + "fdmap", bytes.substr(512 + 199950 + 182, 100).c_str());
     tar_close(archive_.tw);
 }
 

@@ -98,17 +98,22 @@ sockaddr_in loopback(uint16_t port) {
     return address;
 }
 
-// Connects to `port` and writes what comes into the file `path`.
-[[noreturn]] void receive_into(const std::string &path, uint16_t port) {
-    int in = socket(AF_INET, SOCK_STREAM, 0);
+// Writes what comes from `in` into the file `path`.
+[[noreturn]] void copy_into(const std::string &path, int in) {
     int out = open(path.c_str(), O_WRONLY | O_CREAT, 0600);
-    sockaddr_in address = loopback(port);
-    if (connect(in, reinterpret_cast<sockaddr *>(&address), sizeof address) != 0)
-        _exit(1);
     char block[4096];
     for (ssize_t n; (n = read(in, block, sizeof block)) > 0;)
         (void)!write(out, block, static_cast<size_t>(n));
     _exit(0);
+}
+
+// Connects to `port` and writes what comes into the file `path`.
+[[noreturn]] void receive_into(const std::string &path, uint16_t port) {
+    int in = socket(AF_INET, SOCK_STREAM, 0);
+    sockaddr_in address = loopback(port);
+    if (connect(in, reinterpret_cast<sockaddr *>(&address), sizeof address) != 0)
+        _exit(1);
+    copy_into(path, in);
 }
 
 TEST(AddNetdump, OfAQuietNetworkHoldsTheHeaderAndFillerUpToTheSize) {
@@ -204,6 +209,34 @@ TEST(AddNetdump, ToAConnectedSocketLeavesItsOwnConnectionOut) {
         ASSERT_EQ(300000u, stream.size());
         for (long length : records(stream))
             EXPECT_LE(length, 0);
+    });
+}
+
+TEST(AddNetdump, OntoAPipeHasNoFilterAndHoldsAllTraffic) {
+    run_in_sandbox([] {
+        int ends[2];
+        ASSERT_EQ(0, pipe(ends));
+        TempDir dir;
+        std::string received = dir / "received";
+        pid_t reader = fork();
+        if (reader == 0) {
+            close(ends[1]);
+            copy_into(received, ends[0]);
+        }
+        close(ends[0]);
+        pid_t sender = fork();
+        if (sender == 0) {
+            close(ends[1]);
+            send_datagrams("127.0.0.1");
+        }
+        EXPECT_EQ(0, add_netdump(nullptr, ends[1], "lo", 1, 30000));
+        close(ends[1]);
+        waitpid(reader, nullptr, 0);
+        kill(sender, SIGKILL);
+        waitpid(sender, nullptr, 0);
+        std::string stream = read_whole_file(received);
+        ASSERT_EQ(30000u, stream.size());
+        EXPECT_EQ(1536, records(stream).at(0));
     });
 }
 

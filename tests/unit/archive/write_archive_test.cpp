@@ -31,7 +31,26 @@ TEST(WriteArchive, NumbersTheArchivesOfOneProcessWhetherCompressedOrNot) {
     });
 }
 
-TEST(WriteArchive, EndsBehindTheHeaderOfACaptureThatIsNotAllowed) {
+TEST(WriteArchive, LeavesStandardOutputOpenInTheCompressorWhenItIsTheArchive) {
+    run_in_sandbox([] {
+        TempDir dir;
+        pid_t pid = fork();
+        if (pid == 0) {
+            set_core_program("/nonexistent", -1);
+            dup2(open((dir / "a.tgz").c_str(), O_WRONLY | O_CREAT, 0600), 1);
+            write_archive_gz(1);
+            _exit(0);
+        }
+        int status;
+        waitpid(pid, &status, 0);
+        EXPECT_EQ(0, status);
+        RunResult names =
+            run_program({"/bin/sh", "-c", "gzip -dc " + dir / "a.tgz" + " | head -c 6"});
+        EXPECT_EQ("debug-", names.out);
+    });
+}
+
+TEST(WriteArchive, OfACaptureThatIsNotAllowedEndsBehindItsHeaderWithNothingMore) {
     run_in_sandbox([] {
         TempDir dir;
         set_core_program("/nonexistent", -1);
