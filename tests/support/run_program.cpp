@@ -38,6 +38,12 @@ void drain(int &fd, std::string &text) {
     }
 }
 
+// Has the execve close all other descriptors.
+void keep_standard_streams_only() {
+    for (int fd = 3; fd < 1024; ++fd)
+        (void)fcntl(fd, F_SETFD, FD_CLOEXEC);
+}
+
 RunResult result_of(int status) {
     RunResult result;
     if (WIFEXITED(status))
@@ -67,6 +73,10 @@ Background::Background(const std::vector<std::string> &argv, const RunOptions &o
         dup2(out[1], 1);
         dup2(err[1], 2);
         signal(SIGPIPE, SIG_DFL);
+        // SIGSEGV is left to the kernel under a sanitizer, too: tests want to see its doing.
+        setenv("ASAN_OPTIONS",
+               options.leak_check ? "handle_segv=0" : "handle_segv=0:detect_leaks=0", 1);
+        keep_standard_streams_only();
         if (options.before_exec)
             options.before_exec();
         execve(argv[0].c_str(), args.data(), options.env.empty() ? environ : env.data());

@@ -8,10 +8,13 @@
 #include <vector>
 
 struct RunOptions {
-    std::string argv0{};                  // instead of the path, when not empty
-    std::string input{};                  // all of standard input
-    std::vector<std::string> env{};       // the whole environment; the test's own when empty
-    int timeout_s = 60;                   // then it is killed, and the test fails
+    std::string argv0{};             // instead of the path, when not empty
+    std::string input{};             // all of standard input
+    std::vector<std::string> env{};  // the whole environment; the test's own when empty
+    int timeout_s = 60;              // then it is killed, and the test fails
+    // A program built with a sanitizer: false where the search for leaks cannot work at its end,
+    // for want of /proc, descriptors or the right to trace.
+    bool leak_check = true;
     std::function<void()> before_exec{};  // runs in the child
 };
 
@@ -28,8 +31,9 @@ RunResult run_program(const std::vector<std::string> &argv, const RunOptions &op
 // Runs fieldkit as applet `args[0]`.
 RunResult run_fieldkit(const std::vector<std::string> &args, const RunOptions &options = {});
 
-// A program that runs while the test does, and has begun when the object is made. Its standard
-// output is read line by line; it is killed and reaped at the end of the object's life.
+// A program that has only its standard streams, and runs while the test does, and has begun when
+// the object is made. Its standard output is read line by line; it is killed and reaped at the end
+// of the object's life.
 class Background {
   public:
     explicit Background(const std::vector<std::string> &argv, const RunOptions &options = {});

@@ -157,6 +157,7 @@ TEST(Pcapdump, SucceedsEvenWithoutAPacketSocket) {
         [] {
             TempDir dir;
             RunOptions options;
+            options.leak_check = false;
             options.before_exec = [] {
                 // Enough for the standard streams and the file.
                 const rlimit four = {.rlim_cur = 4, .rlim_max = 4};
