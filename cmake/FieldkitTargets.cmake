@@ -13,6 +13,10 @@ if(FIELDKIT_SANITIZE)
     -fsanitize=${FIELDKIT_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
   target_link_options(fieldkit_options INTERFACE -fsanitize=${FIELDKIT_SANITIZE})
 endif()
+if(FIELDKIT_FUZZ)
+  # Only the fuzzers themselves are linked with libFuzzer's main program.
+  target_compile_options(fieldkit_options INTERFACE -fsanitize=fuzzer-no-link)
+endif()
 
 # What the product itself is compiled with on top: it must run where no C++ run-time library is
 # installed, so nothing may need one.
