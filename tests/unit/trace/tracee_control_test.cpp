@@ -3,6 +3,9 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sched.h>
+
+#include <memory>
 
 #include "unit/trace/tracees.h"
 
@@ -60,35 +63,74 @@ TEST(TraceAttach, IsRefusedForAProcessThatIsTracedAlready) {
 
 int taken_pipe[2];
 
+// A process that takes no signal, as it waits for the child of a vfork, until it is let go; then it
+// tells of each SIGHUP through taken_pipe.
+class Waiting {
+  public:
+    Waiting() {
+        (void)!pipe(go_pipe_);
+        (void)!pipe2(taken_pipe, O_NONBLOCK);
+        child_ = std::make_unique<Child>([this] {
+            signal(SIGHUP, [](int) { (void)!write(taken_pipe[1], "", 1); });
+            if (syscall(SYS_clone, CLONE_VFORK | SIGCHLD, 0, 0, 0, 0) == 0) {
+                char byte;
+                (void)!read(go_pipe_[0], &byte, 1);
+                _exit(0);
+            }
+            sleep_for_ever();
+        });
+        EXPECT_TRUE(wait_until([&] { return process_state(pid()) == 'D'; }));
+    }
+    ~Waiting() {
+        for (int fd : {go_pipe_[0], go_pipe_[1], taken_pipe[0], taken_pipe[1]})
+            close(fd);
+    }
+    pid_t pid() const { return child_->pid(); }
+    void wait_for_tracer() const {
+        wait_until([&] { return status_field(pid(), "TracerPid:\t") != "0"; });
+    }
+    void let_go() { (void)!write(go_pipe_[1], "", 1); }
+
+  private:
+    int go_pipe_[2];
+    std::unique_ptr<Child> child_;
+};
+
 TEST(TraceAttach, GivesAnotherSignalThatComesFirstToTheProcess) {
-    int go_pipe[2];
-    ASSERT_EQ(pipe(go_pipe), 0);
-    ASSERT_EQ(pipe2(taken_pipe, O_NONBLOCK), 0);
-    // While it waits for the child of a vfork, a process takes no signal.
-    Child child([&] {
-        signal(SIGHUP, [](int) { (void)!write(taken_pipe[1], "", 1); });
-        if (vfork() == 0) {
-            char byte;
-            (void)!read(go_pipe[0], &byte, 1);
-            _exit(0);
-        }
-        sleep_for_ever();
-    });
-    pid_t pid = child.pid();
-    ASSERT_TRUE(wait_until([&] { return process_state(pid) == 'D'; }));
+    Waiting process;
     // Both signals then wait in the same queue, from which the lower number is taken first.
-    ASSERT_EQ(syscall(SYS_tkill, pid, SIGHUP), 0);
+    ASSERT_EQ(syscall(SYS_tkill, process.pid(), SIGHUP), 0);
     Child outsider([&] {
-        wait_until([&] { return status_field(pid, "TracerPid:\t") != "0"; });
-        (void)!write(go_pipe[1], "", 1);
+        process.wait_for_tracer();
+        process.let_go();
     });
-    EXPECT_EQ(trace_attach(pid), pid);
-    trace_detach(pid);
+    EXPECT_EQ(trace_attach(process.pid()), process.pid());
+    trace_detach(process.pid());
     char byte;
     EXPECT_TRUE(wait_until([&] { return read(taken_pipe[0], &byte, 1) == 1; })) << "lost";
-    EXPECT_TRUE(runs_free(pid)) << process_state(pid);
-    for (int fd : {go_pipe[0], go_pipe[1], taken_pipe[0], taken_pipe[1]})
-        close(fd);
+    EXPECT_TRUE(runs_free(process.pid())) << process_state(process.pid());
+}
+
+TEST(TraceAttach, ThatIsInterruptedIsGivenUpAndLeavesTheProcessAlone) {
+    struct sigaction before;
+    struct sigaction action = {};
+    action.sa_handler = [](int) {};
+    sigaction(SIGUSR1, &action, &before);
+    Waiting process;
+    pid_t test = getpid();
+    Child outsider([&] {
+        process.wait_for_tracer();
+        // By now it waits for the stop, which cannot come before the process is let go.
+        wait_until([&] { return process_state(test) == 'S'; });
+        for (int i = 0; i < 5; ++i) {
+            kill(test, SIGUSR1);
+            usleep(20000);
+        }
+        process.let_go();
+    });
+    EXPECT_EQ(trace_attach(process.pid()), -1);
+    EXPECT_TRUE(runs_free(process.pid())) << process_state(process.pid());
+    sigaction(SIGUSR1, &before, nullptr);
 }
 
 TEST(TraceDetach, DeliversItsSignal) {
@@ -123,7 +165,8 @@ TEST(TraceDetach, LeavesAProcessAloneThatItDoesNotTrace) {
 TEST(TraceDetach, ReturnsWhenTheProcessHasEnded) {
     Child child([] { _exit(0); }, Child::HELD);
     ASSERT_EQ(trace_cont(child.pid(), 0), 0);
-    ASSERT_TRUE(wait_until([&] { return process_state(child.pid()) == 'Z'; }));
+    siginfo_t info;
+    ASSERT_EQ(waitid(P_PID, static_cast<id_t>(child.pid()), &info, WEXITED | WNOWAIT), 0);
     trace_detach(child.pid());
     EXPECT_EQ(waitpid(child.pid(), nullptr, 0), -1) << "it has been reaped";
 }
