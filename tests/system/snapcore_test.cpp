@@ -12,7 +12,8 @@
 namespace {
 
 std::string snapcore() {
-    return SOURCE_DIR "/contrib/snapcore";
+    const char *dir = getenv("CONTRIB");
+    return std::string(dir != nullptr ? dir : SOURCE_DIR "/contrib") + "/snapcore";
 }
 
 class Snapcore : public testing::Test {
@@ -127,10 +128,11 @@ TEST_F(Snapcore, AFullDiskGivesNoHalfCore) {
 TEST_F(Snapcore, LeavesNothingBehindWhenItsReaderGoesAway) {
     run_in_sandbox([] {
         Echo target;
-        sandbox_shell("env -i " + snapcore() + " -c /dev/stdout " + target.pid() +
-                      " 2>/dev/null | head -c 100 >/dev/null");
+        TempDir dir;
+        sandbox_shell("env -i TMPDIR=" + dir.path() + " " + snapcore() + " -c /dev/stdout " +
+                      target.pid() + " 2>/dev/null | head -c 100 >/dev/null");
         target.expect_answers();
-        sandbox_shell("test -z \"$(ls -A /tmp | grep snapcore)\"");
+        sandbox_shell("test -z \"$(ls -A " + dir.path() + ")\"");
     });
 }
 
