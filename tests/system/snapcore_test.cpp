@@ -8,6 +8,7 @@
 
 #include "support/run_program.h"
 #include "support/sandbox.h"
+#include "support/temp_dir.h"
 
 namespace {
 
