@@ -36,7 +36,7 @@ struct Image {
         image->read.push_back(offset);
         if (offset < image->bytes.size())
             memcpy(buf, image->bytes.data() + offset,
-                   std::min<size_t>(4096, image->bytes.size() - offset));
+                   std::min<size_t>(4096, image->bytes.size() - static_cast<size_t>(offset)));
     }
 };
 
