@@ -23,7 +23,6 @@
 #include "support/log_devices.h"
 #include "support/oops_image.h"
 #include "support/run_program.h"
-#include "support/sandbox.h"
 #include "support/temp_dir.h"
 
 namespace {
