@@ -161,7 +161,9 @@ void on_syscall_stop(Trace *trace, int index) {
 void on_event_stop(Trace *trace, int index) {
     pid_t pid = trace->request->pids[index];
     trace_event(trace->request, pid, TRACE_EVENT_STOP, 0, nullptr);
-    (void)step(trace, index, trace_trap_signal(pid));
+    // Passed on whatever made it, which is why a process that executes another program under a
+    // trace is killed unless it ignores SIGTRAP. Readers of traces know that; it must stay.
+    (void)step(trace, index, SIGTRAP);
 }
 
 void on_signal_stop(Trace *trace, int index, int sig) {
@@ -338,4 +340,6 @@ void trace_run(TraceRequest *request) {
     free(request->buf);
     request->buf = nullptr;
     request->buf_size = 0;
+    // What was complained of must not wait for a child that is forked later, to come out there.
+    (void)fflush(stdout);
 }

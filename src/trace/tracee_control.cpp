@@ -103,8 +103,9 @@ int trace_attach(pid_t pid) {
         if (sig == SIGSTOP || trace_in_job_stop(pid, sig))
             break;
         // A signal of its own came first. It gets that one, and the SIGSTOP of the attach is waited
-        // for: taken later for a signal from outside, it would stop the process for good.
-        if (signal_request(PTRACE_CONT, pid, sig == SIGTRAP ? trace_trap_signal(pid) : sig) == -1)
+        // for: taken later for a signal from outside, it would stop the process for good. A SIGTRAP
+        // at this point is the kernel's word of an execve, and no signal of the process.
+        if (signal_request(PTRACE_CONT, pid, sig == SIGTRAP ? 0 : sig) == -1)
             break;
     }
     if (waited != -1 && !interrupted)
@@ -163,15 +164,6 @@ bool trace_in_job_stop(pid_t pid, int sig) {
     siginfo_t info;
     return is_job_control_signal(sig) && ptrace(PTRACE_GETSIGINFO, pid, nullptr, &info) == -1 &&
            errno == EINVAL;
-}
-
-int trace_trap_signal(pid_t pid) {
-    // The kernel sends the one of an execve in the name of the process itself, as with kill; a
-    // breakpoint and raise() have other codes.
-    siginfo_t info;
-    bool told_execve = ptrace(PTRACE_GETSIGINFO, pid, nullptr, &info) != -1 &&
-                       info.si_signo == SIGTRAP && info.si_code == SI_USER && info.si_pid == pid;
-    return told_execve ? 0 : SIGTRAP;
 }
 
 TraceeStatus parse_tracee_status(const char *text) {

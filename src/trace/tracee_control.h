@@ -26,10 +26,6 @@ long trace_syscall(pid_t pid, int sig);
 // job control stops it), rather than that it is about to receive the signal.
 bool trace_in_job_stop(pid_t pid, int sig);
 
-// The signal to let the tracee `pid`, stopped with SIGTRAP, go on with: none if the kernel made
-// that SIGTRAP to tell the tracer of an execve. It is nobody's signal, and would kill the process.
-int trace_trap_signal(pid_t pid);
-
 // What /proc tells about a process that may be a tracee.
 struct TraceeStatus {
     char state;    // 'R', 'S', 'T', 't', 'Z' ...; 0 when unknown

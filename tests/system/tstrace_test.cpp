@@ -257,10 +257,19 @@ TEST(Tstrace, EndsWithACommandThatIsKilled) {
     EXPECT_EQ(trace_fixture("behave", {"die"}).exit_status, 0);
 }
 
-TEST(Tstrace, FollowsACommandThatReplacesItself) {
+TEST(Tstrace, FollowsACommandThatReplacesItselfUntilTheSigtrapOfItsExecve) {
     RunResult result = trace_fixture("behave", {"exec"});
     EXPECT_EQ(result.exit_status, 0);
-    EXPECT_TRUE(contains(result.out, "\nready\n")) << result.out;
+    size_t entry = result.out.find("] execve(");
+    ASSERT_NE(entry, std::string::npos) << result.out;
+    EXPECT_NE(result.out.find("] execve(", entry + 1), std::string::npos) << "its exit";
+    EXPECT_FALSE(contains(result.out, "exit_group(4)")) << result.out;
+    EXPECT_FALSE(contains(result.out, "SIGNAL")) << result.out;
+}
+
+TEST(Tstrace, FollowsACommandThatReplacesItselfAndIgnoresSigtrapToItsEnd) {
+    RunResult result = trace_fixture("behave", {"exec-ignoring"});
+    EXPECT_EQ(result.exit_status, 0);
     EXPECT_TRUE(contains(result.out, "exit_group(4)\n")) << result.out;
     EXPECT_FALSE(contains(result.out, "SIGNAL")) << result.out;
 }

@@ -7,8 +7,8 @@
 #include <random>
 #include <string>
 
-#include "support/temp_dir.h"
 #include "support/guarded_buffer.h"
+#include "support/temp_dir.h"
 #include "unit/trace/made_up_mips_kernel.h"
 #include "util/unique_fd.h"
 

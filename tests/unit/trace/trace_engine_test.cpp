@@ -606,15 +606,23 @@ TEST_F(TraceRun, TellsASigtrapAsAnEventAndDeliversIt) {
     EXPECT_EQ(log.all(), "") << "no SIGNAL line";
 }
 
-TEST_F(TraceRun, LetsAProcessLiveThatReplacesItself) {
-    Child child([] { execl("/bin/sh", "sh", "-c", "exit 6", nullptr); }, Child::HELD);
-    TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
-    request.attached = 1;
-    trace_run(&request);
-    ASSERT_FALSE(log.events.empty());
-    EXPECT_EQ(log.events.back().second, 6u << 8);
+TEST_F(TraceRun, PassesTheSigtrapOfAnExecveOnAndSoKillsAProcessThatDoesNotIgnoreIt) {
+    for (bool ignored : {false, true}) {
+        Child child(ignored ? +[] {
+                       signal(SIGTRAP, SIG_IGN);
+                       execl("/bin/sh", "sh", "-c", "exit 6", nullptr);
+                   }
+                            : +[] { execl("/bin/sh", "sh", "-c", "exit 6", nullptr); },
+                    Child::HELD);
+        TraceLog log;
+        std::vector<pid_t> pids = {child.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
+        request.attached = 1;
+        trace_run(&request);
+        ASSERT_FALSE(log.events.empty());
+        unsigned long core = log.events.back().second & 0x80;
+        EXPECT_EQ(log.events.back().second, ignored ? 6ul << 8 : SIGTRAP | core);
+    }
 }
 
 TEST_F(TraceRun, DoesNotStopAProcessThatAnotherThreadReplaced) {
@@ -627,6 +635,7 @@ TEST_F(TraceRun, DoesNotStopAProcessThatAnotherThreadReplaced) {
             pthread_create(
                 &thread, nullptr,
                 [](void *) -> void * {
+                    signal(SIGTRAP, SIG_IGN);
                     execl("/bin/sh", "sh", "-c", "echo; while :; do :; done", nullptr);
                     _exit(1);
                 },
