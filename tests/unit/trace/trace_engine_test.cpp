@@ -44,9 +44,11 @@ size_t count_of(const std::string &text, const std::string &part) {
     return count;
 }
 
-// The name that a trace shows for a child of the test.
+// The name that a trace shows for a child of the test: of the word it was started by, what follows
+// the last slash in the first 31 characters.
 std::string own_name() {
-    return program_invocation_short_name;
+    std::string start = std::string(program_invocation_name).substr(0, 31);
+    return start.substr(start.rfind('/') + 1);
 }
 
 // How often the descriptors of `pid` were listed.
