@@ -1,7 +1,6 @@
 #include "trace/tracer_command_line.h"
 
 #include <errno.h>
-#include <poll.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -22,13 +21,13 @@ namespace {
 
 constexpr size_t MAX_PATH_SIZE = 4096;
 constexpr const char *DEFAULT_PATH = "/bin:/sbin:/usr/bin:/usr/sbin:/usr/local/bin";
-constexpr time_t SLEEP_STEP_S = 999;
+constexpr unsigned SLEEP_STEP_S = 999;
 
 std::atomic<bool> stop_flag;
 
 // Sends SIGINT again and again once one has come, until the trace has ended. The first may have
-// come just before the engine's wait, which it then did not interrupt: if the traced processes
-// sleep, nothing else would.
+// come just before the engine's wait for an event, or a sleep, which it then did not interrupt; and
+// while the traced processes sleep, nothing else would.
 timer_t repeat_timer;
 std::atomic<bool> repeating;
 constexpr itimerspec REPEAT_AFTER = {.it_interval = {.tv_sec = 0, .tv_nsec = 0},
@@ -134,17 +133,8 @@ bool stop_requested() {
 }
 
 void sleep_until_stop_requested() {
-    sigset_t interrupt;
-    sigset_t before;
-    sigemptyset(&interrupt);
-    sigaddset(&interrupt, SIGINT);
-    (void)pthread_sigmask(SIG_BLOCK, &interrupt, &before);
-    sigset_t sleeping = before;
-    sigdelset(&sleeping, SIGINT);
-    const timespec step = {.tv_sec = SLEEP_STEP_S, .tv_nsec = 0};
     while (!stop_requested())
-        (void)ppoll(nullptr, 0, &step, &sleeping);
-    (void)pthread_sigmask(SIG_SETMASK, &before, nullptr);
+        (void)sleep(SLEEP_STEP_S);
 }
 
 uint32_t trace_write_cb(intptr_t fd, const char *text, uint32_t len) {

@@ -10,7 +10,7 @@
 // Set by SIGINT once run_tracer has begun to trace.
 bool stop_requested();
 
-// Sleeps until stop_requested. A SIGINT that comes just before the sleep is not missed.
+// Sleeps until stop_requested. Only while run_tracer traces, which lets no SIGINT be missed.
 void sleep_until_stop_requested();
 
 // An output callback: writes the text to the descriptor `fd`, failed or not. Returns 1 until

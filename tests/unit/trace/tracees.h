@@ -1,12 +1,15 @@
 // Processes to be traced by tests, and a record of what a trace hands out.
 #pragma once
 
+#include <errno.h>
+#include <gtest/gtest.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/prctl.h>
 #include <sys/ptrace.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -68,6 +71,18 @@ inline void spin_for_ever() {
 inline void call_for_ever() {
     for (;;)
         syscall(SYS_getppid);
+}
+
+inline void receive_signals() {
+    signal(SIGALRM, [](int) { syscall(SYS_getppid); });
+    itimerval often = {{0, 300}, {0, 300}};
+    setitimer(ITIMER_REAL, &often, nullptr);
+    sleep_for_ever();
+}
+
+inline void yield_and_sleep() {
+    for (;;)
+        usleep(50);
 }
 
 // The rest of the line of /proc/PID/status that begins with `field`; empty when it has gone.
@@ -143,3 +158,17 @@ inline TraceRequest request_for(TraceLog *log, std::vector<pid_t> *pids, uint32_
     request.timeout_s = -1;
     return request;
 }
+
+// The name that a trace shows for a child of the test: of the word it was started by, what follows
+// the last slash in the first 31 characters.
+inline std::string own_name() {
+    std::string start = std::string(program_invocation_name).substr(0, 31);
+    return start.substr(start.rfind('/') + 1);
+}
+
+// Keeps a hanging trace from hanging the test run.
+class TraceRun : public testing::Test {
+  protected:
+    void SetUp() override { alarm(100); }
+    void TearDown() override { alarm(0); }
+};

@@ -1,0 +1,240 @@
+// How a trace leaves the processes that it has traced: neither stopped nor traced.
+#include <gtest/gtest.h>
+#include <pthread.h>
+#include <unistd.h>
+
+#include "trace/trace_engine.h"
+#include "unit/trace/tracees.h"
+
+namespace {
+
+// A process with two threads; the test gets the number of the second.
+struct Threaded {
+    int pipe_fds[2];
+
+    static void *run_second(void *self) {
+        pid_t tid = static_cast<pid_t>(syscall(SYS_gettid));
+        (void)!write(static_cast<Threaded *>(self)->pipe_fds[1], &tid, sizeof tid);
+        spin_for_ever();
+        return nullptr;
+    }
+
+    void start() {
+        pthread_t thread;
+        pthread_create(&thread, nullptr, run_second, this);
+    }
+
+    pid_t second() {
+        pid_t tid = -1;
+        (void)!read(pipe_fds[0], &tid, sizeof tid);
+        return tid;
+    }
+
+    Threaded() { (void)!pipe(pipe_fds); }
+    ~Threaded() {
+        close(pipe_fds[0]);
+        close(pipe_fds[1]);
+    }
+};
+
+struct Behaviour {
+    const char *name;
+    void (*body)();
+};
+
+class TraceRunLeaves : public testing::TestWithParam<Behaviour> {};
+
+TEST_P(TraceRunLeaves, TheProcessNeitherStoppedNorTraced) {
+    alarm(100);
+    Child child(GetParam().body);
+    bool sleeps = GetParam().body == sleep_for_ever || GetParam().body == spin_for_ever;
+    for (int round = 1; round <= (sleeps ? 1 : 60); ++round) {
+        TraceLog log;
+        log.polls_wanted = round;
+        std::vector<pid_t> pids = {child.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+        request.timeout_s = 1;
+        trace_run(&request);
+        ASSERT_EQ(pids[0], child.pid());
+        ASSERT_TRUE(runs_free(child.pid())) << process_state(child.pid()) << " in round " << round;
+    }
+    alarm(0);
+}
+
+INSTANTIATE_TEST_SUITE_P(Processes, TraceRunLeaves,
+                         testing::Values(Behaviour{"Sleeping", sleep_for_ever},
+                                         Behaviour{"Spinning", spin_for_ever},
+                                         Behaviour{"Calling", call_for_ever},
+                                         Behaviour{"SleepingAndWaking", yield_and_sleep},
+                                         Behaviour{"ReceivingSignals", receive_signals}),
+                         [](const auto &test) { return test.param.name; });
+
+TEST_F(TraceRun, LetsGoOfAProcessThatIsNotItsChild) {
+    int pipe_fds[2];
+    ASSERT_EQ(pipe(pipe_fds), 0);
+    Child parent([&] {
+        Child grandchild(call_for_ever);
+        pid_t pid = grandchild.pid();
+        (void)!write(pipe_fds[1], &pid, sizeof pid);
+        sleep_for_ever();
+    });
+    pid_t pid;
+    ASSERT_EQ(read(pipe_fds[0], &pid, sizeof pid), static_cast<ssize_t>(sizeof pid));
+    for (int round = 1; round <= 20; ++round) {
+        TraceLog log;
+        log.polls_wanted = round;
+        std::vector<pid_t> pids = {pid};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+        trace_run(&request);
+        ASSERT_TRUE(runs_free(pid));
+    }
+    kill(pid, SIGKILL);
+    close(pipe_fds[0]);
+    close(pipe_fds[1]);
+}
+
+TEST_F(TraceRun, LetsManyProcessesGoAtOnce) {
+    Child sleeping(sleep_for_ever), spinning(spin_for_ever), calling(call_for_ever);
+    Child waking(yield_and_sleep), signalled(receive_signals);
+    TraceLog log;
+    log.polls_wanted = 500;
+    std::vector<pid_t> pids = {sleeping.pid(), spinning.pid(), calling.pid(), waking.pid(),
+                               signalled.pid()};
+    TraceRequest request = request_for(&log, &pids, UINT32_MAX);
+    trace_run(&request);
+    for (pid_t pid : pids)
+        EXPECT_TRUE(runs_free(pid)) << process_state(pid);
+}
+
+TEST_F(TraceRun, SurvivesProcessesThatEndWhileItLetsThemGo) {
+    for (int round = 0; round < 60; ++round) {
+        auto body = [round] {
+            for (int i = 0; i < round; ++i)
+                syscall(SYS_getppid);
+            _exit(0);
+        };
+        Child first(body, Child::HELD), second(body, Child::HELD), third(body, Child::HELD);
+        TraceLog log;
+        log.polls_wanted = 3 * round;
+        std::vector<pid_t> pids = {first.pid(), second.pid(), third.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS | TRACE_EXIT_EVENT);
+        request.attached = 1;
+        trace_run(&request);
+        for (pid_t pid : pids)
+            EXPECT_TRUE(pid == -1 ||
+                        wait_until([&] { return waitpid(pid, nullptr, WNOHANG) != 0; }))
+                << "does not come to its end";
+    }
+}
+
+TEST_F(TraceRun, SurvivesProcessesThatAreKilledMeanwhile) {
+    for (int round = 0; round < 20; ++round) {
+        Child child(call_for_ever);
+        pid_t pid = child.pid();
+        Child killer([pid, round] {
+            usleep(static_cast<useconds_t>(round) * 300);
+            kill(pid, SIGKILL);
+        });
+        TraceLog log;
+        std::vector<pid_t> pids = {pid};
+        TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
+        trace_run(&request);
+        EXPECT_EQ(pids[0], -1);
+    }
+}
+
+TEST_F(TraceRun, LetsGoAlsoWhileSignalsInterruptIt) {
+    struct sigaction action = {};
+    action.sa_handler = [](int) {};
+    struct sigaction before;
+    sigaction(SIGUSR1, &action, &before);
+    Child spinning(spin_for_ever), sleeping(sleep_for_ever);
+    pid_t test = getpid();
+    Child sender([test] {
+        for (;;)
+            kill(test, SIGUSR1);
+    });
+    for (int round = 0; round < 40; ++round) {
+        TraceLog log;
+        log.polls_wanted = 1;
+        std::vector<pid_t> pids = {spinning.pid(), sleeping.pid()};
+        TraceRequest request = request_for(&log, &pids);
+        trace_run(&request);
+        // Whether an interrupted attach is given up or not: nothing is left behind.
+        ASSERT_TRUE(runs_free(spinning.pid())) << process_state(spinning.pid());
+        ASSERT_TRUE(runs_free(sleeping.pid())) << process_state(sleeping.pid());
+    }
+    kill(sender.pid(), SIGKILL);
+    sigaction(SIGUSR1, &before, nullptr);
+}
+
+TEST_F(TraceRun, LeavesTheUntracedThreadsOfAProcessRunning) {
+    Threaded threaded;
+    Child child([&] {
+        threaded.start();
+        spin_for_ever();
+    });
+    pid_t second = threaded.second();
+    for (int round = 0; round < 60; ++round) {
+        TraceLog log;
+        std::vector<pid_t> pids = {round % 2 == 0 ? child.pid() : second};
+        TraceRequest request = request_for(&log, &pids);
+        // A process that only spins brings no event: the trace ends with that of another child.
+        Child other([] { _exit(0); });
+        log.polls_wanted = 1;
+        trace_run(&request);
+        ASSERT_NE(pids[0], -1);
+        ASSERT_TRUE(runs_free(child.pid())) << process_state(child.pid());
+        ASSERT_TRUE(runs_free(second)) << process_state(second);
+    }
+}
+
+TEST_F(TraceRun, EndsInTimeThoughAMainThreadHasEndedBeforeItsProcess) {
+    Threaded threaded;
+    Child child(
+        [&] {
+            threaded.start();
+            syscall(SYS_exit, 0);
+        },
+        Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.attached = 1;
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_EQ(process_state(child.pid()), 'Z');
+    EXPECT_TRUE(runs_free(threaded.second()));
+}
+
+TEST_F(TraceRun, DoesNotStopAProcessThatAnotherThreadReplaced) {
+    Threaded threaded;
+    static int pipe_fds[2];
+    ASSERT_EQ(pipe2(pipe_fds, 0), 0);
+    Child child(
+        [] {
+            pthread_t thread;
+            pthread_create(
+                &thread, nullptr,
+                [](void *) -> void * {
+                    signal(SIGTRAP, SIG_IGN);
+                    execl("/bin/sh", "sh", "-c", "echo; while :; do :; done", nullptr);
+                    _exit(1);
+                },
+                nullptr);
+            dup2(pipe_fds[1], 1);
+            sleep_for_ever();
+        },
+        Child::HELD);
+    TraceLog log;
+    std::vector<pid_t> pids = {child.pid()};
+    TraceRequest request = request_for(&log, &pids);
+    request.attached = 1;
+    request.timeout_s = 1;
+    trace_run(&request);
+    EXPECT_TRUE(runs_free(child.pid())) << process_state(child.pid());
+    close(pipe_fds[0]);
+    close(pipe_fds[1]);
+}
+
+}  // namespace
