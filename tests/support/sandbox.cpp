@@ -148,7 +148,8 @@ void sandbox_scratch(const std::string &path) {
 
 void sandbox_bind(const std::string &source, const std::string &path) {
     namespace fs = std::filesystem;
-    if (!fs::exists(path)) {
+    // A link gives way too: what it points to may be everything, as with busybox.
+    if (!fs::exists(path) || fs::is_symlink(path)) {
         fs::path base = fs::path(path).parent_path();
         while (!fs::exists(base))
             base = base.parent_path();
@@ -159,6 +160,7 @@ void sandbox_bind(const std::string &source, const std::string &path) {
         if (layered.insert(base).second)
             sandbox_scratch(base);
         fs::create_directories(fs::path(path).parent_path());
+        fs::remove(path);
         if (fs::is_directory(source))
             fs::create_directory(path);
         else

@@ -18,7 +18,7 @@ struct SandboxOptions {
 void run_in_sandbox(const std::function<void()> &body, const SandboxOptions &options = {});
 
 // Only inside a sandbox: makes `path`, a file or directory, appear as `source`, by a bind mount. A
-// `path` that does not exist is made in a scratch layer over the nearest directory that does.
+// `path` that does not exist, or is a link, is made in a scratch layer over the nearest directory.
 void sandbox_bind(const std::string &source, const std::string &path);
 
 // Only inside a sandbox: makes the existing directory `path` writable without a trace outside: a

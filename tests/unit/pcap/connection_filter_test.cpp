@@ -79,7 +79,7 @@ std::optional<uint32_t> load(std::string_view frame, uint64_t at, unsigned size)
         return std::nullopt;
     uint32_t ret = 0;
     for (unsigned i = 0; i < size; ++i)
-        ret = ret << 8 | static_cast<uint8_t>(frame[at + i]);
+        ret = ret << 8 | static_cast<uint8_t>(frame[static_cast<size_t>(at + i)]);
     return ret;
 }
 
