@@ -29,7 +29,7 @@ struct CallRow {
 
 // On MIPS a row is found by its number; the name is checked. On other machines the number differs,
 // and a row stands for the call of the same name. A call that has no row here is shown as six
-// numbers: that is deliberate for the socket calls from getpeername to send, too.
+// numbers: that is deliberate for the other socket calls, too, some of which have a sub-call here.
 constexpr CallRow CALL_ROWS[] = {
     {4001, "exit", ArgStyle::EXIT},
     {4003, "read", ArgStyle::READ},

@@ -40,7 +40,8 @@ struct SyscallAbi {
     unsigned long count;         // entries of `names`, and of `styles` and `subcalls`
     const char *const *names;
     const ArgStyle *styles;
-    const uint8_t *subcalls;          // the socketcall sub-call of each ArgStyle::SOCKET call
+    const uint8_t
+        *subcalls;  // the socketcall sub-call that each direct socket call stands for, else 2
     const char *const *signal_names;  // 32 slots; an empty one is null
 };
 

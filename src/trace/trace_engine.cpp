@@ -8,6 +8,7 @@
 #include <string.h>
 #include <sys/ptrace.h>
 #include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -23,7 +24,7 @@ namespace {
 constexpr uint32_t DEFAULT_BUF_SIZE = 4096;
 constexpr uint32_t IN_SYSCALL = 1;            // the bit of TracedProcess::in_syscall
 constexpr int SYSCALL_STOP = SIGTRAP | 0x80;  // as PTRACE_O_TRACESYSGOOD marks it
-constexpr useconds_t HELD_POLL_US = 50 * 1000;
+constexpr long HELD_POLL_MS = 50;
 
 // One trace at a time: the wait for any child would otherwise take the other trace's events.
 pthread_mutex_t trace_mutex = PTHREAD_MUTEX_INITIALIZER;
@@ -31,9 +32,10 @@ pthread_mutex_t trace_mutex = PTHREAD_MUTEX_INITIALIZER;
 // A trace under way.
 struct Trace {
     TraceRequest *request;
-    int live;     // processes that have not been seen to end
-    int held;     // processes with TracedProcess::held
-    pid_t timer;  // the child that measures the time limit, or -1
+    int live;           // processes that have not been seen to end
+    int held;           // processes with TracedProcess::held
+    pid_t timer;        // the child that measures the time limit, or -1
+    int64_t looked_ms;  // when held processes were last looked after
 };
 
 // Whether the caller wants the trace to go on.
@@ -138,8 +140,9 @@ void show_syscall(Trace *trace, int index) {
         if (length != -1) {
             process.in_syscall |= IN_SYSCALL;
         } else {
-            // An entry that cannot be shown is shown as the exit of the call before, less its
-            // newline, and its own exit is tried as an entry.
+            // An entry whose registers cannot be read is shown as the exit of the call before, less
+            // its newline; of a number out of range nothing is shown. The exit that follows is
+            // taken for an entry.
             length = syscall_exit_stop(request, pid, &record, request->buf, request->buf_size,
                                        &process.regs, &process.exit_record) -
                      1;
@@ -200,22 +203,36 @@ void on_stop(Trace *trace, int index, int status) {
 
 // ---- The loop ----
 
+int64_t now_ms() {
+    timespec now;
+    (void)clock_gettime(CLOCK_MONOTONIC, &now);
+    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
+}
+
 // Lets processes go on that were held and have been sent SIGCONT. The kernel wakes a tracee for no
-// signal but SIGKILL, and does not tell its tracer either; but the "continued" state that it keeps
-// for the parent can be looked at without taking it away.
+// signal but SIGKILL, and does not tell its tracer either, so this is looked for now and then.
 void step_continued(Trace *trace) {
+    int64_t now = now_ms();
+    if (now - trace->looked_ms < HELD_POLL_MS)
+        return;
+    trace->looked_ms = now;
     TraceRequest *request = trace->request;
     for (int i = 0; i < request->nr_pids; ++i) {
-        if (!request->records[i].held)
-            continue;
-        siginfo_t info = {};
-        if (waitid(P_PID, static_cast<id_t>(request->pids[i]), &info,
-                   WCONTINUED | WNOHANG | WNOWAIT) != -1 &&
-            info.si_code == CLD_CONTINUED) {
+        if (request->records[i].held && trace_sigcont_pending(request->pids[i])) {
             set_held(trace, i, false);
             (void)step(trace, i, 0);
         }
     }
+}
+
+// Blocks until a child or tracee may have something to tell, at most HELD_POLL_MS. SIGCHLD is
+// blocked, so that none is lost between the look and this. False when another signal came.
+bool await_child_signal() {
+    sigset_t child_signal;
+    (void)sigemptyset(&child_signal);
+    (void)sigaddset(&child_signal, SIGCHLD);
+    timespec limit = {.tv_sec = 0, .tv_nsec = HELD_POLL_MS * 1000000L};
+    return sigtimedwait(&child_signal, nullptr, &limit) != -1 || errno == EAGAIN;
 }
 
 // waitpid for any child or tracee.
@@ -225,7 +242,7 @@ pid_t wait_for_event(Trace *trace, int *status) {
         if (pid != 0)
             return pid;
         step_continued(trace);
-        if (usleep(HELD_POLL_US) == -1)
+        if (!await_child_signal())
             return -1;
     }
     return waitpid(-1, status, __WALL);
@@ -305,18 +322,29 @@ void release_processes(TraceRequest *request, bool list_fds) {
 }
 
 // The trace proper, with records and buffer in place.
-void run(TraceRequest *request) {
-    Trace trace = {.request = request, .live = 0, .held = 0, .timer = -1};
+void run_trace(Trace *trace) {
+    TraceRequest *request = trace->request;
     for (int i = 0; i < request->nr_pids; ++i) {
         if (request->pids[i] != -1)
-            take_process(&trace, i);
+            take_process(trace, i);
     }
-    if (trace.live == 0)
+    if (trace->live == 0)
         return;
-    if (start_timer(&trace))
-        follow(&trace);
-    stop_timer(&trace);
+    if (start_timer(trace))
+        follow(trace);
+    stop_timer(trace);
     release_processes(request, (request->flags & TRACE_LIST_FDS) != 0);
+}
+
+void run(TraceRequest *request) {
+    Trace trace = {.request = request, .live = 0, .held = 0, .timer = -1, .looked_ms = 0};
+    sigset_t child_signal;
+    sigset_t before;
+    (void)sigemptyset(&child_signal);
+    (void)sigaddset(&child_signal, SIGCHLD);
+    (void)pthread_sigmask(SIG_BLOCK, &child_signal, &before);
+    run_trace(&trace);
+    (void)pthread_sigmask(SIG_SETMASK, &before, nullptr);
 }
 
 }  // namespace

@@ -32,7 +32,7 @@ constexpr int TRACED_NAME_SIZE = 32;
 struct TracedProcess {
     char name[TRACED_NAME_SIZE];  // last path component of its first command-line word, or empty
     uint32_t in_syscall;          // bit 0: the last system-call stop was an entry
-    bool stop_told;               // it was let go on with a signal that stops it
+    bool stop_told;               // it was let go on with a signal, which may stop it
     bool held;                    // left in the stop that such a signal made, until SIGCONT
     TraceRegisters regs;          // as at that entry
     unsigned long exit_record;    // the result word of the last exit stop

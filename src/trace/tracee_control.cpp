@@ -36,7 +36,7 @@ long resume(enum __ptrace_request request, pid_t pid, int sig, const char *label
 
 TraceeStatus tracee_status(pid_t pid) {
     char path[64];
-    char text[1024];
+    char text[4096];
     (void)snprintf(path, sizeof path, "/proc/%d/status", pid);
     ssize_t len = read_file(path, text, sizeof text - 1);
     text[len > 0 ? len : 0] = '\0';
@@ -81,6 +81,14 @@ pid_t wait_for_attach(pid_t pid, int *status, bool *interrupted) {
             return -1;
         }
     }
+}
+
+// The lower 64 signals of a mask, whose line must be whole: some machines have 128.
+uint64_t parse_signal_mask(const char *digits) {
+    size_t length = strspn(digits, "0123456789abcdef");
+    if (digits[length] != '\n')
+        return 0;
+    return strtoull(digits + (length > 16 ? length - 16 : 0), nullptr, 16);
 }
 
 bool is_job_control_signal(int sig) {
@@ -166,6 +174,10 @@ bool trace_in_job_stop(pid_t pid, int sig) {
            errno == EINVAL;
 }
 
+bool trace_sigcont_pending(pid_t pid) {
+    return (tracee_status(pid).pending >> (SIGCONT - 1) & 1) != 0;
+}
+
 TraceeStatus parse_tracee_status(const char *text) {
     TraceeStatus status = {};
     for (const char *line = text; line != nullptr; line = strchr(line, '\n')) {
@@ -174,6 +186,8 @@ TraceeStatus parse_tracee_status(const char *text) {
             status.state = line[7];
         else if (strncmp(line, "TracerPid:\t", 11) == 0 && strchr(line, '\n') != nullptr)
             status.tracer = static_cast<pid_t>(strtol(line + 11, nullptr, 10));
+        else if (strncmp(line, "SigPnd:\t", 8) == 0 || strncmp(line, "ShdPnd:\t", 8) == 0)
+            status.pending |= parse_signal_mask(line + 8);
     }
     return status;
 }

@@ -4,6 +4,7 @@
 // that thread. The tracer's complaints go to standard output.
 #pragma once
 
+#include <stdint.h>
 #include <sys/types.h>
 
 // Attaches to `pid` and waits for its stop. Returns -1 when that is refused or interrupted, and
@@ -26,10 +27,15 @@ long trace_syscall(pid_t pid, int sig);
 // job control stops it), rather than that it is about to receive the signal.
 bool trace_in_job_stop(pid_t pid, int sig);
 
+// Whether SIGCONT has been sent to the stopped tracee `pid` and has not got through to it.
+bool trace_sigcont_pending(pid_t pid);
+
 // What /proc tells about a process that may be a tracee.
 struct TraceeStatus {
     char state;    // 'R', 'S', 'T', 't', 'Z' ...; 0 when unknown
     pid_t tracer;  // the thread that traces it; 0 when unknown or none
+    uint64_t
+        pending;  // its pending signals from 1 (the lowest bit) to 64, of the thread or the process
 };
 
 // Parses the text of /proc/PID/status; a line that is missing or cut leaves its field 0.

@@ -17,7 +17,7 @@ void sleep_until_stop_requested();
 // stop_requested.
 uint32_t trace_write_cb(intptr_t fd, const char *text, uint32_t len);
 
-// The path of the executable that `command` names, searched as a shell would with PATH (or a few
+// The path of the executable that `command` names, searched in the directories of PATH (or a few
 // usual directories when that is unset), or null. Execute permission is not looked at.
 UniqueBlock<char> find_in_path(const char *command);
 

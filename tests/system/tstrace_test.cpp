@@ -84,7 +84,7 @@ TEST(Tstrace, ComplainsOfAFileThatCannotBeExecuted) {
     TempDir dir;
     RunOptions options;
     // Where leaks are looked for, the child that cannot execute the file would do so, in vain.
-    options.before_exec = [] { setenv("ASAN_OPTIONS", "detect_leaks=0", 1); };
+    options.leak_check = false;
     RunResult result = run_fieldkit({"tstrace", dir.file("file", "no program", 0644)}, options);
     EXPECT_EQ(result.exit_status, 0);
     EXPECT_EQ(result.err, "execve: Permission denied\n");

@@ -1,6 +1,7 @@
 // Signals and stops of traced processes.
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include "trace/trace_engine.h"
@@ -66,6 +67,24 @@ TEST_F(TraceRun, KeepsAStoppedProcessStoppedUntilItIsContinued) {
     EXPECT_EQ(count_of(log.all(), "SIGCONT"), 1u) << log.all();
     close(pipe_fds[0]);
     close(pipe_fds[1]);
+}
+
+TEST_F(TraceRun, IsNotSlowedByAStoppedProcess) {
+    Child stopped(yield_and_sleep);
+    kill(stopped.pid(), SIGSTOP);
+    ASSERT_TRUE(wait_until([&] { return process_state(stopped.pid()) == 'T'; }));
+    Child busy([] {
+        for (;;)
+            syscall(SYS_getppid);
+    });
+    TraceLog log;
+    std::vector<pid_t> pids = {stopped.pid(), busy.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    request.timeout_s = 2;
+    trace_run(&request);
+    // Polling would allow some 20 stops a second.
+    EXPECT_GT(count_of(log.all(), "getppid("), 2000u);
+    EXPECT_EQ(process_state(stopped.pid()), 'T');
 }
 
 TEST_F(TraceRun, AttachesToAStoppedProcessAndLeavesItStopped) {

@@ -36,6 +36,16 @@ TEST(ParseTraceeStatus, TakesACutLineForAMissingOne) {
     }
 }
 
+TEST(ParseTraceeStatus, JoinsThePendingSignalsOfThreadAndProcess) {
+    EXPECT_EQ(parse_tracee_status("SigPnd:\t0000000000000001\nShdPnd:\t0000000000020000\n").pending,
+              0x20001u);
+    // Of 128 signals the lower half.
+    EXPECT_EQ(
+        parse_tracee_status("ShdPnd:\t00000000000000070000000001000000\nSigBlk:\tff\n").pending,
+        0x1000000u);
+    EXPECT_EQ(parse_tracee_status("SigPnd:\t00000000").pending, 0u) << "a cut line";
+}
+
 TEST(ParseTraceeStatus, OfNothingIsUnknown) {
     for (const char *text : {"", "\n", "\n\n\n", "no such\nfields"}) {
         EXPECT_EQ(parse_tracee_status(text).state, 0);
