@@ -74,6 +74,7 @@ Background::Background(const std::vector<std::string> &argv, const RunOptions &o
         dup2(err[1], 2);
         signal(SIGPIPE, SIG_DFL);
         // SIGSEGV is left to the kernel under a sanitizer, too: tests want to see its doing.
+        setenv("TSAN_OPTIONS", "handle_segv=0", 1);
         setenv("ASAN_OPTIONS",
                options.leak_check ? "handle_segv=0" : "handle_segv=0:detect_leaks=0", 1);
         keep_standard_streams_only();
