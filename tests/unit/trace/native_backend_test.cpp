@@ -104,7 +104,12 @@ TEST(NativeBackend, ShowsARealCallAtItsEntryAndExit) {
         EXPECT_EQ(entry.arg[i], 11 + i);
     EXPECT_NE(entry.pc, 0U);
     EXPECT_FALSE(in_program(entry.pc));
+#if defined(__mips__)
+    // There syscall() does not make the call itself but in a routine that returns into it.
+    EXPECT_NE(entry.ra, 0U);
+#else
     EXPECT_TRUE(in_program(entry.ra)) << std::hex << entry.ra;
+#endif
     EXPECT_STREQ(syscall_name(*backend.abi, entry.number), "getppid");
 
     child.next_stop();
@@ -140,6 +145,9 @@ TEST(NativeBackend, PutsAChangedResultBack) {
     child.next_stop();
     backend.exit_record(child.pid(), regs, &record);
     record.result = 77;
+#if defined(__mips__)
+    record.arg[3] = 0;  // a3, which by now tells the process whether the call has failed
+#endif
     backend.write_back(child.pid(), regs, record, false);
     EXPECT_EQ(child.exit_status(), 77);
 }
