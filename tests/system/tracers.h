@@ -10,38 +10,11 @@
 #include <regex>
 #include <string>
 
+#include "support/process_state.h"
 #include "support/run_program.h"
-
-// The rest of the line of /proc/PID/status that begins with `field`; empty when it has gone.
-inline std::string status_field(pid_t pid, const std::string &field) {
-    std::string path = "/proc/" + std::to_string(pid) + "/status";
-    FILE *file = fopen(path.c_str(), "r");
-    if (file == nullptr)
-        return "";
-    std::string found;
-    char line[512];
-    while (fgets(line, sizeof line, file) != nullptr) {
-        if (strncmp(line, field.c_str(), field.size()) == 0)
-            found = std::string(line + field.size(), strcspn(line + field.size(), "\n"));
-    }
-    fclose(file);
-    return found;
-}
-
-inline char process_state(pid_t pid) {
-    return (status_field(pid, "State:\t") + "?")[0];
-}
 
 inline bool wait_for_state(pid_t pid, char state) {
     return wait_until([&] { return process_state(pid) == state; });
-}
-
-// Whether the process is neither traced nor stopped.
-inline bool runs_free(pid_t pid) {
-    return status_field(pid, "TracerPid:\t") == "0" && wait_until([&] {
-               char state = process_state(pid);
-               return state == 'R' || state == 'S';
-           });
 }
 
 // Reads lines until one contains `part`, and returns that one.

@@ -9,6 +9,7 @@
 
 #include <string>
 
+#include "support/gunzip.h"
 #include "support/temp_dir.h"
 
 namespace {
@@ -28,20 +29,6 @@ std::string filter(const std::string &input) {
     EXPECT_EQ(pid, waitpid(pid, &status, 0));
     EXPECT_EQ(0, status);
     return read_whole_file(dir / "out");
-}
-
-// What zlib reads from the gzip file `file`.
-std::string gunzip(const std::string &file) {
-    TempDir dir;
-    gzFile in = gzopen(dir.file("a.gz", file).c_str(), "rb");
-    std::string text;
-    char block[65536];
-    int n;
-    while ((n = gzread(in, block, sizeof block)) > 0)
-        text.append(block, static_cast<size_t>(n));
-    EXPECT_EQ(0, n);
-    EXPECT_EQ(Z_OK, gzclose(in));
-    return text;
 }
 
 std::string varied(size_t size) {

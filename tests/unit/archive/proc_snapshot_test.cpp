@@ -44,45 +44,41 @@ TEST(CopyDirFiles, SaysWhenADirectoryCannotBeOpened) {
     EXPECT_EQ(0u, archive.close().size());
 }
 
-// The directory of a made-up tree as it appears below /proc, with a file "file" in each of `dirs`.
-void fake_proc(const TempDir &fake, std::initializer_list<const char *> dirs) {
-    for (const char *dir : dirs)
-        fake.file(std::string(dir) + "file", dir);
-}
-
 TEST(SnapshotProc, HoldsTheTopLevelAndThe26DirectoriesInOrder) {
-    run_in_sandbox([] {
+    const std::vector<std::string> dirs = {"sys/",
+                                           "sys/fs/",
+                                           "sys/kernel/",
+                                           "sys/kernel/random/",
+                                           "sys/net/bridge/",
+                                           "sys/net/core/",
+                                           "sys/net/ipv4/",
+                                           "sys/net/ipv4/conf/",
+                                           "sys/net/ipv4/neigh/",
+                                           "sys/net/ipv4/route/",
+                                           "sys/net/ipv6/",
+                                           "sys/net/ipv6/conf/",
+                                           "sys/net/ipv6/icmp/",
+                                           "sys/net/ipv6/neigh/",
+                                           "sys/net/ipv6/route/",
+                                           "sys/net/unix/",
+                                           "sys/vm/",
+                                           "driver/",
+                                           "net/",
+                                           "net/dev_snmp6/",
+                                           "net/ip6t_hashlimit/",
+                                           "net/ipt_hashlimit/",
+                                           "net/netfilter/",
+                                           "net/rpc/",
+                                           "net/stat/",
+                                           "net/vlan/"};
+    run_in_sandbox([&] {
         TempDir fake;
         for (const char *name : {"kcore", "vmcore", "kmem", "kmsg", "meminfo"})
             fake.file(name, name);
-        fake_proc(fake, {"sys/",
-                         "sys/fs/",
-                         "sys/kernel/",
-                         "sys/kernel/random/",
-                         "sys/net/bridge/",
-                         "sys/net/core/",
-                         "sys/net/ipv4/",
-                         "sys/net/ipv4/conf/",
-                         "sys/net/ipv4/neigh/",
-                         "sys/net/ipv4/route/",
-                         "sys/net/ipv6/",
-                         "sys/net/ipv6/conf/",
-                         "sys/net/ipv6/icmp/",
-                         "sys/net/ipv6/neigh/",
-                         "sys/net/ipv6/route/",
-                         "sys/net/unix/",
-                         "sys/vm/",
-                         "driver/",
-                         "net/",
-                         "net/dev_snmp6/",
-                         "net/ip6t_hashlimit/",
-                         "net/ipt_hashlimit/",
-                         "net/netfilter/",
-                         "net/rpc/",
-                         "net/stat/",
-                         "net/vlan/",
-                         "bus/",
-                         "123/"});
+        for (const std::string &dir : dirs)
+            fake.file(dir + "file", dir);
+        for (const char *other : {"bus/file", "123/file"})
+            fake.file(other, "not taken");
         ArchiveFile archive;
         sandbox_bind(fake.path(), "/proc");
         EXPECT_EQ(0, snapshot_proc(archive.tw, archive.fd.get()));
@@ -96,40 +92,10 @@ TEST(SnapshotProc, HoldsTheTopLevelAndThe26DirectoriesInOrder) {
                   (first.substr(5, 8) + first.substr(14, 6)).find_first_not_of("0123456789"));
         EXPECT_EQ("/meminfo", first.substr(20));
         EXPECT_EQ("meminfo", members[0].data);
-        EXPECT_EQ((std::vector<std::string>{"sys/",
-                                            "sys/fs/",
-                                            "sys/kernel/",
-                                            "sys/kernel/random/",
-                                            "sys/net/bridge/",
-                                            "sys/net/core/",
-                                            "sys/net/ipv4/",
-                                            "sys/net/ipv4/conf/",
-                                            "sys/net/ipv4/neigh/",
-                                            "sys/net/ipv4/route/",
-                                            "sys/net/ipv6/",
-                                            "sys/net/ipv6/conf/",
-                                            "sys/net/ipv6/icmp/",
-                                            "sys/net/ipv6/neigh/",
-                                            "sys/net/ipv6/route/",
-                                            "sys/net/unix/",
-                                            "sys/vm/",
-                                            "driver/",
-                                            "net/",
-                                            "net/dev_snmp6/",
-                                            "net/ip6t_hashlimit/",
-                                            "net/ipt_hashlimit/",
-                                            "net/netfilter/",
-                                            "net/rpc/",
-                                            "net/stat/",
-                                            "net/vlan/"}),
-                  [&] {
-                      std::vector<std::string> dirs;
-                      for (size_t i = 1; i < members.size(); ++i) {
-                          EXPECT_EQ("top/proc/" + members[i].data + "file", members[i].name);
-                          dirs.push_back(members[i].data);
-                      }
-                      return dirs;
-                  }());
+        for (size_t i = 0; i < dirs.size(); ++i) {
+            EXPECT_EQ("top/proc/" + dirs[i] + "file", members[i + 1].name);
+            EXPECT_EQ(dirs[i], members[i + 1].data);
+        }
     });
 }
 

@@ -17,6 +17,7 @@
 #include <string>
 #include <vector>
 
+#include "support/process_state.h"
 #include "support/run_program.h"
 #include "support/temp_dir.h"
 #include "trace/trace_request.h"
@@ -83,34 +84,6 @@ inline void receive_signals() {
 inline void yield_and_sleep() {
     for (;;)
         usleep(50);
-}
-
-// The rest of the line of /proc/PID/status that begins with `field`; empty when it has gone.
-inline std::string status_field(pid_t pid, const std::string &field) {
-    std::string path = "/proc/" + std::to_string(pid) + "/status";
-    FILE *file = fopen(path.c_str(), "r");
-    if (file == nullptr)
-        return "";
-    std::string found;
-    char line[512];
-    while (fgets(line, sizeof line, file) != nullptr) {
-        if (strncmp(line, field.c_str(), field.size()) == 0)
-            found = std::string(line + field.size(), strcspn(line + field.size(), "\n"));
-    }
-    fclose(file);
-    return found;
-}
-
-inline char process_state(pid_t pid) {
-    return (status_field(pid, "State:\t") + "?")[0];
-}
-
-// Whether the process is neither traced nor stopped. The kernel may take a moment to let it go on.
-inline bool runs_free(pid_t pid) {
-    return status_field(pid, "TracerPid:\t") == "0" && wait_until([&] {
-               char state = process_state(pid);
-               return state == 'R' || state == 'S';
-           });
 }
 
 // The texts and exits that a trace hands out. It ends the trace with the poll number `polls_wanted`

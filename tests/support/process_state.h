@@ -1,0 +1,15 @@
+// What /proc tells a test about a process.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+
+// The rest of the line of /proc/PID/status that begins with `field`; empty when it has gone.
+std::string status_field(pid_t pid, const std::string &field);
+
+// Its state letter, '?' when it has gone.
+char process_state(pid_t pid);
+
+// Whether the process is neither traced nor stopped. The kernel may take a moment to let it go on.
+bool runs_free(pid_t pid);
