@@ -10,15 +10,14 @@
 #include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
-#include <string.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <string>
 #include <vector>
+
+#include "rounds.h"
 
 namespace {
 
@@ -27,21 +26,7 @@ struct Cost {
     double wall_s;
 };
 
-struct Command {
-    std::string name;
-    std::vector<char *> argv;  // ends with null
-    std::vector<Cost> costs;   // one of each round
-};
-
-double seconds(const timeval &time) {
-    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_usec) / 1e6;
-}
-
-double now() {
-    timespec time;
-    clock_gettime(CLOCK_MONOTONIC, &time);
-    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
-}
+using Command = MeasuredCommand<Cost>;
 
 void redirect(const char *path, int flags, int fd) {
     const int opened = open(path, flags);
@@ -69,34 +54,7 @@ Cost run(const Command &command, const char *input) {
                 static_cast<unsigned>(status));
         exit(1);
     }
-    return {seconds(usage.ru_utime) + seconds(usage.ru_stime), now() - start};
-}
-
-// Of `value` over the rounds.
-template <typename Value>
-double median(size_t rounds, Value value) {
-    std::vector<double> values;
-    for (size_t i = 0; i < rounds; ++i)
-        values.push_back(value(i));
-    std::sort(values.begin(), values.end());
-    const size_t middle = rounds / 2;
-    return rounds % 2 == 1 ? values[middle] : (values[middle - 1] + values[middle]) / 2;
-}
-
-std::vector<Command> read_commands(char **words) {
-    std::vector<Command> commands;
-    while (*words != nullptr) {
-        Command command = {*words++, {}, {}};
-        while (*words != nullptr && strcmp(*words, "--") != 0)
-            command.argv.push_back(*words++);
-        if (command.argv.empty())
-            return {};
-        command.argv.push_back(nullptr);
-        commands.push_back(command);
-        if (*words != nullptr)
-            ++words;
-    }
-    return commands;
+    return {cpu_seconds(usage), now() - start};
 }
 
 void print_rows(const std::vector<Command> &commands, size_t rounds) {
@@ -122,7 +80,7 @@ int main(int argc, char **argv) {
     std::vector<Command> commands;
     const int rounds = argc > 4 ? atoi(argv[1]) : 0;
     if (rounds > 0)
-        commands = read_commands(argv + 3);
+        commands = read_commands<Cost>(argv + 3);
     if (commands.empty()) {
         fprintf(stderr, "usage: compare ROUNDS INPUT NAME COMMAND... [-- NAME COMMAND...]...\n");
         return 2;

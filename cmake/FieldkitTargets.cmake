@@ -23,7 +23,9 @@ endif()
 add_library(fieldkit_product_options INTERFACE)
 target_link_libraries(fieldkit_product_options INTERFACE fieldkit_options)
 target_compile_options(fieldkit_product_options INTERFACE
-  -fno-exceptions -fno-rtti -fno-threadsafe-statics -ffunction-sections -fdata-sections)
+  -fno-exceptions -fno-rtti -fno-threadsafe-statics -ffunction-sections -fdata-sections
+  # A broken invariant ends the program in a release, too: on a device nobody would see it otherwise.
+  -UNDEBUG)
 target_link_options(fieldkit_product_options INTERFACE -Wl,--gc-sections)
 
 # fieldkit_module(NAME SOURCES file... [LINKS target...])
@@ -37,6 +39,9 @@ function(fieldkit_module name)
   file(MAKE_DIRECTORY ${include_dir})
   file(CREATE_LINK ${CMAKE_CURRENT_SOURCE_DIR} ${include_dir}/${name} SYMBOLIC)
   add_library(fieldkit_${name} STATIC ${arg_SOURCES})
+  # Nothing outside the executable looks its functions up: on MIPS the dynamic linker would do that
+  # for each of them at every start.
+  target_compile_options(fieldkit_${name} PRIVATE -fvisibility=hidden)
   target_include_directories(fieldkit_${name} PUBLIC ${include_dir})
   target_link_libraries(fieldkit_${name} PUBLIC ${arg_LINKS} PRIVATE fieldkit_product_options)
 endfunction()

@@ -10,7 +10,7 @@
 
 namespace {
 
-constexpr size_t MAX_FILE_SIZE = 1 << 20;
+constexpr off_t MAX_FILE_SIZE = 1 << 20;
 
 struct Config {
     IniText ini;
@@ -21,7 +21,7 @@ struct Config {
 char *read_text(int fd) {
     struct stat status;
     if (fstat(fd, &status) != 0 || !S_ISREG(status.st_mode) || status.st_size < 0 ||
-        static_cast<size_t>(status.st_size) > MAX_FILE_SIZE) {
+        status.st_size > MAX_FILE_SIZE) {
         return nullptr;
     }
     const size_t size = static_cast<size_t>(status.st_size);

@@ -24,6 +24,7 @@ constexpr int MAX_WAITING = 32;
 // Work for one call of sockhand_recv; what is left keeps the descriptor readable.
 constexpr int MAX_EVENTS = 2 * MAX_WAITING;
 constexpr int SEND_TIMEOUT_S = 5;
+constexpr useconds_t SHORTAGE_PAUSE_US = 20000;
 
 struct Connection {
     int fd;  // -1: the slot is free
@@ -164,6 +165,9 @@ int accept_without_descriptors(Server *server) {
     close_quietly(server->reserve);
     close_quietly(accept_nonblocking(server));
     server->reserve = open_reserve();
+    // Another thread was faster. Until it gives one back there is nobody to be turned away.
+    if (server->reserve < 0)
+        (void)usleep(SHORTAGE_PAUSE_US);
     return -1;
 }
 

@@ -1,15 +1,18 @@
 #include "archive/gzip_stream.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <stdint.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 #include <zlib.h>
 
 #include "archive/write_archive.h"
-#include "util/spawn.h"
+#include "util/children.h"
 #include "util/stream.h"
+#include "util/unique_fd.h"
 
 namespace {
 
@@ -84,17 +87,18 @@ bool compress_all(Compressor *c) {
     return finish(c) && write_little_endian(c->crc) && write_little_endian(c->size);
 }
 
-[[noreturn]] void run_compressor(int in_fd, int out_fd) {
-    if (out_fd != STDOUT_FILENO) {
-        (void)close(STDOUT_FILENO);
-        (void)dup2(out_fd, STDOUT_FILENO);
+void close_descriptors_from(int first) {
+#ifdef SYS_close_range
+    if (syscall(SYS_close_range, first, ~0u, 0) == 0)
+        return;
+#endif
+    // Linux before 5.9.
+    UniqueDir dir(opendir("/proc/self/fd"));
+    while (const dirent *entry = dir != nullptr ? readdir(dir.get()) : nullptr) {
+        int fd = atoi(entry->d_name);
+        if (fd >= first && fd != dirfd(dir.get()))
+            (void)close(fd);
     }
-    if (in_fd != STDIN_FILENO) {
-        (void)close(STDIN_FILENO);
-        (void)dup2(in_fd, STDIN_FILENO);
-    }
-    gzip_filter();
-    exit(0);
 }
 
 }  // namespace
@@ -112,6 +116,22 @@ void gzip_filter() {
     (void)deflateEnd(&c.stream);
 }
 
+void run_gzip_child(int in_fd, int out_fd) {
+    if (out_fd != STDOUT_FILENO) {
+        (void)close(STDOUT_FILENO);
+        (void)dup2(out_fd, STDOUT_FILENO);
+    }
+    if (in_fd != STDIN_FILENO) {
+        (void)close(STDIN_FILENO);
+        (void)dup2(in_fd, STDIN_FILENO);
+    }
+    // There is no execve to close them.
+    close_descriptors_from(STDERR_FILENO + 1);
+    gzip_filter();
+    // Not exit: it would write out what the service has buffered for its own standard output.
+    _exit(0);
+}
+
 void write_archive_gz(int out_fd) {
     int ends[2] = {-1, -1};
     // Not for the programs that the collectors start: the compressor must see the end of its input
@@ -120,17 +140,15 @@ void write_archive_gz(int out_fd) {
         perror("pipes");
         return;
     }
-    pid_t pid = fork();
+    pid_t pid = fork_child(false);
     if (pid == -1) {
         perror("fork");
         (void)close(ends[0]);
         (void)close(ends[1]);
         return;
     }
-    if (pid == 0) {
-        (void)close(ends[1]);
-        run_compressor(ends[0], out_fd);
-    }
+    if (pid == 0)
+        run_gzip_child(ends[0], out_fd);
     (void)close(ends[0]);
     write_archive(ends[1], pid);
     (void)close(ends[1]);

@@ -9,3 +9,8 @@ void write_archive_gz(int out_fd);
 // Compresses descriptor 0 into a gzip file on descriptor 1, until the input ends or the output
 // breaks.
 void gzip_filter();
+
+// What the compressing child does, right after the fork: runs gzip_filter from `in_fd` to `out_fd`,
+// and exits with 0. It keeps no other descriptor than 0, 1 and 2, so that the connections of other
+// requests end when they should, and not with this archive.
+[[noreturn]] void run_gzip_child(int in_fd, int out_fd);

@@ -12,6 +12,7 @@
 #include "pcap/capture.h"
 #include "pcap/connection_filter.h"
 #include "trace/trace_engine.h"
+#include "util/await_reader.h"
 #include "util/spawn.h"
 #include "util/stream.h"
 #include "util/unique_fd.h"
@@ -26,9 +27,19 @@ constexpr uint32_t CAPTURE_CUT_LENGTH = 1536;  // bytes per record
 constexpr off_t KCORE_LIMIT = 10485760;
 constexpr int32_t STRACE_SIZE = 204800;
 constexpr int32_t STRACE_DURATION = 5;  // seconds
+constexpr int READER_PATIENCE = 5;      // seconds, in which all that is traced stands still
 
-uint32_t write_trace(intptr_t writer, const char *text, uint32_t len) {
-    return bounded_write_cb(reinterpret_cast<BoundedWriter *>(writer), text, len);
+struct TraceLog {
+    BoundedWriter writer;
+    bool given_up;  // the reader takes nothing: the trace ends, the archive goes on
+};
+
+uint32_t write_trace(intptr_t cookie, const char *text, uint32_t len) {
+    auto *log = reinterpret_cast<TraceLog *>(cookie);
+    const bool writes = static_cast<int32_t>(len) > 0 && log->writer.remaining > 0;
+    if (writes && !log->given_up)
+        log->given_up = !await_reader(log->writer.fd, READER_PATIENCE, nullptr);
+    return log->given_up ? 0 : bounded_write_cb(&log->writer, text, len);
 }
 
 }  // namespace
@@ -67,21 +78,21 @@ int pcap_request(int fd, int32_t duration, int32_t size) {
 }
 
 int add_strace_log(TarWriter *tw, pid_t *pids, int count) {
-    BoundedWriter writer = {tw->fd, STRACE_SIZE, 0};
+    TraceLog log = {.writer = {tw->fd, STRACE_SIZE, 0}, .given_up = false};
     tar_header(tw, "strace.log", STRACE_SIZE);
 
     TraceRequest request = {};
     request.output_cb = write_trace;
-    request.cookie = reinterpret_cast<intptr_t>(&writer);
+    request.cookie = reinterpret_cast<intptr_t>(&log);
     request.flags = static_cast<uint32_t>(-1);
     request.pids = pids;
     request.nr_pids = count;
     request.timeout_s = STRACE_DURATION;
     trace_run(&request);
 
-    if (writer.failed)
+    if (log.writer.failed)
         return 1;
-    write_space_lines(tw->fd, writer.remaining);
+    write_space_lines(tw->fd, log.writer.remaining);
     tar_account(tw, STRACE_SIZE);
     return 0;
 }

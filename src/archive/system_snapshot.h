@@ -22,7 +22,8 @@ int add_netdump(TarWriter *tw, int fd, const char *interface, int32_t duration, 
 int pcap_request(int fd, int32_t duration, int32_t size);
 
 // Traces the processes `pids` for 5 seconds into the member "strace.log" of exactly 204800 bytes:
-// cut, or filled up with blank lines. Ended processes become -1.
+// cut, or filled up with blank lines. The trace ends early when the archive's reader takes nothing
+// for 5 seconds, for it may be one of them. Ended processes become -1.
 int add_strace_log(TarWriter *tw, pid_t *pids, int count);
 
 // Writes `n` bytes of blank lines of 80 characters to `fd`, less when a write fails.

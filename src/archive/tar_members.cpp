@@ -55,7 +55,7 @@ int tar_add_small_file(TarWriter *tw, int, const char *name, const char *path, u
 
 int add_command_output(TarWriter *tw, int fd, const char *member, char *const argv[],
                        char *name_template) {
-    UniqueFd output(mkstemp(name_template));
+    UniqueFd output(mkostemp(name_template, O_CLOEXEC));
     if (output.valid())
         (void)unlink(name_template);
     (void)run_process_wait(argv[0], argv, STDIN_FILENO, output.get(), output.get(), false);

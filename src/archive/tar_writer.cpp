@@ -134,7 +134,8 @@ void tar_pad(int fd, uint32_t *count) {
 }
 
 int write_zeros(int fd, int64_t n) {
-    constexpr char ZEROS[32] = {};
+    // As much as any padding takes, so that a small member costs one write for it.
+    constexpr char ZEROS[BLOCK_SIZE] = {};
     while (n > 0) {
         uint32_t piece = static_cast<uint32_t>(std::min<int64_t>(n, sizeof ZEROS));
         if (write_all(fd, ZEROS, piece) < 0)

@@ -7,6 +7,8 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <string_view>
+
 namespace {
 
 // Argument `index` as strtoul reads it, in decimal, "0x" hexadecimal or leading-"0" octal form, 0
@@ -23,7 +25,9 @@ unsigned long number_argument(int argc, char **argv, int index, unsigned long ab
 }  // namespace
 
 int run_ctest(int, char **) {
-    puts("call exit");
+    // Not through stdio, which would take a tenth of all the time from its start to its end.
+    constexpr std::string_view TEXT = "call exit\n";
+    (void)write(STDOUT_FILENO, TEXT.data(), TEXT.size());
     exit(0);
 }
 

@@ -4,7 +4,9 @@
 #include <string.h>
 
 #include "cgi/debugar.h"
+#include "coredump-handler/coredump_handler.h"
 #include "main/fault_applets.h"
+#include "mon/mon.h"
 #include "oops/oopslog.h"
 #include "pcap/pcapdump.h"
 #include "trace/tracer_applets.h"

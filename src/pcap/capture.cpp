@@ -1,66 +1,83 @@
 // Copies the frames seen on a network interface into a stream in the classic pcap format.
 #include "pcap/capture.h"
 
-#include <arpa/inet.h>
 #include <errno.h>
-#include <linux/if_ether.h>
-#include <linux/if_packet.h>
 #include <net/if.h>
 #include <poll.h>
+#include <pthread.h>
+#include <signal.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <sys/ioctl.h>
-#include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/sysinfo.h>
 #include <sys/time.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
+#include <utility>
 
+#include "pcap/frame_source.h"
 #include "pcap/pcap_format.h"
 #include "util/stream.h"
 #include "util/unique_fd.h"
 
 namespace {
 
-// The longest part of a frame that is kept.
-constexpr uint32_t FRAME_SIZE = 1536;
-
-// ETH_P_ALL as a plain number, deliberately not in network byte order: until bind() names the
-// interface and the protocol, the socket then queues nothing on the little-endian device, while
-// htons(ETH_P_ALL) would queue frames of every interface.
-constexpr int UNBOUND_PROTOCOL = 3;
-
 // After a frame that just fits, this leaves room for that frame's record header and for a filler of
 // at least 33 bytes.
 constexpr uint32_t FILLER_RESERVE = 48;
 
+// The uptime is asked for so often at most: that takes as long as taking a frame.
+constexpr int64_t UPTIME_INTERVAL_MS = 100;
+
 // What one wait for frames may last at most: larger values overflow a 32-bit time.
 constexpr int64_t LONGEST_WAIT_S = INT32_MAX;
 
+// Records that are there at the same time are written together.
+constexpr uint32_t BLOCK_SIZE = 65536;
+constexpr uint32_t LARGEST_RECORD = PCAP_RECORD_HEADER_SIZE + FRAME_SIZE;
+
+// On a busy line, where frames follow each other this closely for a while, to be woken for each of
+// them costs more than all else; there a short pause lets some gather in the ring.
+constexpr int64_t BUSY_INTERVAL_US = 100;
+constexpr uint32_t BUSY_FRAMES = 16;
+// The pause: as long as it takes to fill a part of the ring, and not so long that the times of the
+// frames, which are those at which they are taken, would be of no use.
+constexpr uint32_t GATHERED_SHARE = 8;
+constexpr int64_t LONGEST_PAUSE_US = 500;
+// A clock that is coarser than this would make the pause longer than the ring can bear.
+constexpr long COARSEST_CLOCK_NS = 100000;
+
 constexpr std::array<uint8_t, FRAME_SIZE> ZEROS = {};
 
-// A record as it is written, in one piece.
-struct Record {
-    std::array<uint8_t, PCAP_RECORD_HEADER_SIZE> header;
-    std::array<uint8_t, FRAME_SIZE> frame;
-};
-static_assert(sizeof(Record) == PCAP_RECORD_HEADER_SIZE + FRAME_SIZE);
-
 struct Capture {
-    int socket_fd;
+    FrameSource source;
     int out_fd;
+    int awaited_out_fd;  // the same, or -1 when a read from it will tell nothing any more
     uint32_t size_limit;
     uint32_t cut_length;
     uint32_t time_limit;
-    long start;       // uptime, in seconds
-    int64_t written;  // bytes of the stream so far
-    Record record;
+    bool out_is_file;
+    bool may_pause;
+    long start;                  // uptime, in seconds
+    int64_t uptime_asked_ms;     // when seconds_left was found out, by the clock of coarse_ms()
+    int64_t seconds_left;        // only with a time limit
+    int64_t length;              // bytes of the stream so far, those in the block included
+    UniqueBlock<uint8_t> block;  // BLOCK_SIZE bytes
+    uint32_t block_used;         // of it: records to be written
+    int64_t last_frame_us;       // time of day of the last frame
+    int64_t busy_since_us;       // and of the one that `busy_frames` follow
+    uint32_t busy_frames;
+    std::array<uint8_t, FRAME_SIZE> frame;  // with a cut length: what short frames are followed by
 };
 
-// Why a capture ended.
+// Why a capture ended, or has not.
 enum class End {
+    NOT_YET,
     STOPPED,        // in order: a limit, the interface or the client
     WAIT_FAILED,    // reported
     OUTPUT_BROKEN,  // a write failed
@@ -68,48 +85,53 @@ enum class End {
 
 struct Readable {
     bool packet;
+    bool packet_error;
     bool output;
 };
 
-int report_failure(const char *what) {
-    const int error = errno;
-    perror(what);
-    return -error;
+// A signal that ends the process would stop the write to a file in the midst of a record, so it has
+// to wait. A client may be slow, and a signal is not to wait for that.
+int32_t write_records(const Capture &capture, const void *bytes, uint32_t size) {
+    if (!capture.out_is_file || size <= LARGEST_RECORD)
+        return write_all(capture.out_fd, bytes, size);
+    sigset_t all;
+    sigset_t before;
+    sigfillset(&all);
+    (void)pthread_sigmask(SIG_SETMASK, &all, &before);
+    const int32_t ret = write_all(capture.out_fd, bytes, size);
+    (void)pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    return ret;
 }
 
-// Returns the socket, or the negated error number with the failure printed.
-int open_packet_socket(const char *interface, const sock_fprog *filter) {
-    // An unknown name gives 0, which stands for all interfaces. Looking it up takes a descriptor
-    // for a moment, so it comes first: the last free one would otherwise be the socket's, and the
-    // capture that of all interfaces.
-    const unsigned index = if_nametoindex(interface);
-    UniqueFd ret(socket(AF_PACKET, SOCK_RAW | SOCK_CLOEXEC, UNBOUND_PROTOCOL));
-    if (!ret.valid())
-        return -errno;
-
-    sockaddr_ll address = {};
-    address.sll_family = AF_PACKET;
-    address.sll_protocol = htons(ETH_P_ALL);
-    address.sll_ifindex = static_cast<int>(index);
-    if (bind(ret.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address) < 0)
-        return report_failure("bind");
-    if (filter != nullptr &&
-        setsockopt(ret.get(), SOL_SOCKET, SO_ATTACH_FILTER, filter, sizeof *filter) < 0)
-        return report_failure("setsockopt attach filter");
-    return ret.release();
+bool write_block(Capture *capture) {
+    const uint32_t size = std::exchange(capture->block_used, 0);
+    return size == 0 || write_records(*capture, capture->block.get(), size) >= 0;
 }
 
 bool write_counted(Capture *capture, const void *bytes, uint32_t length) {
     if (write_all(capture->out_fd, bytes, length) < 0)
         return false;
-    capture->written += length;
+    capture->length += length;
     return true;
 }
 
+// A clock that takes no system call, in milliseconds.
+int64_t coarse_ms() {
+    timespec now = {};
+    (void)clock_gettime(CLOCK_MONOTONIC_COARSE, &now);
+    return int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1000000;
+}
+
 // How long the next wait may last; 0 when the time is up. Only with a time limit.
-int64_t seconds_left(const Capture &capture) {
-    const int64_t elapsed = uptime_seconds() - capture.start;
-    return std::clamp<int64_t>(capture.time_limit - elapsed, 0, LONGEST_WAIT_S);
+int64_t seconds_left(Capture *capture) {
+    const int64_t now = coarse_ms();
+    if (now - capture->uptime_asked_ms >= UPTIME_INTERVAL_MS) {
+        const int64_t elapsed = uptime_seconds() - capture->start;
+        capture->uptime_asked_ms = now;
+        capture->seconds_left =
+            std::clamp<int64_t>(capture->time_limit - elapsed, 0, LONGEST_WAIT_S);
+    }
+    return capture->seconds_left;
 }
 
 // Waits, at most until the time is up, until there is something to read. Returns 1, 0 when there
@@ -119,8 +141,8 @@ int64_t seconds_left(const Capture &capture) {
 // descriptors beyond FD_SETSIZE.
 int wait_readable(const Capture &capture, int64_t timeout_s, Readable *readable) {
     const timespec timeout = {.tv_sec = static_cast<time_t>(timeout_s), .tv_nsec = 0};
-    pollfd fds[] = {{.fd = capture.socket_fd, .events = POLLIN, .revents = 0},
-                    {.fd = capture.out_fd, .events = POLLIN, .revents = 0}};
+    pollfd fds[] = {{.fd = capture.source.socket_fd.get(), .events = POLLIN, .revents = 0},
+                    {.fd = capture.awaited_out_fd, .events = POLLIN, .revents = 0}};
     int ready = ppoll(fds, 2, capture.time_limit != 0 ? &timeout : nullptr, nullptr);
     if (((fds[0].revents | fds[1].revents) & POLLNVAL) != 0) {
         errno = EBADF;
@@ -132,37 +154,108 @@ int wait_readable(const Capture &capture, int64_t timeout_s, Readable *readable)
         perror("select");
         return -1;
     }
-    *readable = {.packet = fds[0].revents != 0, .output = fds[1].revents != 0};
+    *readable = {.packet = fds[0].revents != 0,
+                 .packet_error = (fds[0].revents & ~POLLIN) != 0,
+                 .output = fds[1].revents != 0};
     return ready > 0 ? 1 : 0;
 }
 
-// Throws away what the client sends. Returns whether it is still there.
-bool drain_output(const Capture &capture) {
+// Throws away what the client sends. Returns what the read did.
+ssize_t drain_output(const Capture &capture) {
     std::array<uint8_t, FRAME_SIZE> unwanted;
-    return read(capture.out_fd, unwanted.data(), unwanted.size()) > 0;
+    return read(capture.out_fd, unwanted.data(), unwanted.size());
+}
+
+// Looks at an output that is readable. Returns whether its end ends the capture.
+bool client_ends_capture(Capture *capture) {
+    const ssize_t n = drain_output(*capture);
+    if (n > 0)
+        return false;
+    if (capture->time_limit == 0 && capture->size_limit == 0)
+        return true;
+    // With a limit the announced length or time holds even when the client has gone: the next
+    // write tells. Until then it would be readable all the time, and no wait would be one.
+    if (n == 0 || (errno != EAGAIN && errno != EINTR))
+        capture->awaited_out_fd = -1;
+    return false;
 }
 
 bool fits(const Capture &capture, uint32_t captured_length) {
     return capture.size_limit == 0 ||
-           capture.written + FILLER_RESERVE + captured_length < capture.size_limit;
+           capture.length + FILLER_RESERVE + captured_length < capture.size_limit;
 }
 
-bool write_record(Capture *capture, uint32_t captured_length, uint32_t original_length) {
+// Completes the record of a frame whose bytes are in the block already.
+void add_record(Capture *capture, uint32_t captured_length, uint32_t original_length) {
     timeval now;
     (void)gettimeofday(&now, nullptr);
-    capture->record.header = pcap_record_header({.seconds = static_cast<uint32_t>(now.tv_sec),
-                                                 .microseconds = static_cast<uint32_t>(now.tv_usec),
-                                                 .captured_length = captured_length,
-                                                 .original_length = original_length});
-    return write_counted(capture, &capture->record, PCAP_RECORD_HEADER_SIZE + captured_length);
+    const auto header = pcap_record_header({.seconds = static_cast<uint32_t>(now.tv_sec),
+                                            .microseconds = static_cast<uint32_t>(now.tv_usec),
+                                            .captured_length = captured_length,
+                                            .original_length = original_length});
+    std::copy(header.begin(), header.end(), capture->block.get() + capture->block_used);
+    const uint32_t size = PCAP_RECORD_HEADER_SIZE + captured_length;
+    capture->block_used += size;
+    capture->length += size;
+    capture->last_frame_us = int64_t{now.tv_sec} * 1000000 + now.tv_usec;
+    ++capture->busy_frames;
+}
+
+// Takes one frame into the block.
+Taken take_record(Capture *capture, End *end) {
+    uint8_t *bytes = capture->block.get() + capture->block_used + PCAP_RECORD_HEADER_SIZE;
+    const uint32_t cut_length = capture->cut_length;
+    uint32_t original_length = 0;
+    const Taken taken =
+        cut_length != 0
+            ? take_frame(&capture->source, capture->frame.data(), cut_length, &original_length)
+            : take_frame(&capture->source, bytes, FRAME_SIZE, &original_length);
+    if (taken == Taken::FAILURE)
+        *end = End::STOPPED;
+    if (taken != Taken::FRAME)
+        return taken;
+    // The cut holds for short frames, too (what follows them is left over from earlier ones):
+    // with it every record has the same size, and readers count on that.
+    const uint32_t captured_length = cut_length != 0 ? cut_length : original_length;
+    if (!fits(*capture, captured_length)) {
+        *end = End::STOPPED;
+        return taken;
+    }
+    if (cut_length != 0)
+        std::copy_n(capture->frame.data(), cut_length, bytes);
+    add_record(capture, captured_length, original_length);
+    return taken;
+}
+
+// Writes the frames that are there, as many as the block takes. No frame waits for later ones.
+// `all` tells whether there are no more.
+End copy_ready_frames(Capture *capture, bool *all) {
+    End end = End::NOT_YET;
+    *all = false;
+    while (!*all && end == End::NOT_YET && BLOCK_SIZE - capture->block_used >= LARGEST_RECORD)
+        *all = take_record(capture, &end) == Taken::NOTHING;
+    return write_block(capture) ? end : End::OUTPUT_BROKEN;
+}
+
+// For how many microseconds it pays to let frames gather, as fast as they come now.
+int64_t gathering_time(Capture *capture) {
+    const uint32_t frames = capture->busy_frames;
+    if (frames < BUSY_FRAMES || !capture->may_pause)
+        return 0;
+    const int64_t elapsed = capture->last_frame_us - capture->busy_since_us;
+    capture->busy_frames = 0;
+    capture->busy_since_us = capture->last_frame_us;
+    if (elapsed < 0 || elapsed >= frames * BUSY_INTERVAL_US)
+        return 0;
+    const int64_t gathered = capture->source.ring.slots() / GATHERED_SHARE;
+    return std::min(elapsed * gathered / frames, LONGEST_PAUSE_US);
 }
 
 End copy_frames(Capture *capture) {
-    const bool until_client_goes = capture->time_limit == 0 && capture->size_limit == 0;
     for (;;) {
         int64_t timeout_s = 0;
         if (capture->time_limit != 0) {
-            timeout_s = seconds_left(*capture);
+            timeout_s = seconds_left(capture);
             if (timeout_s == 0)
                 return End::STOPPED;
         }
@@ -174,27 +267,23 @@ End copy_frames(Capture *capture) {
         if (ready == 0)
             continue;
 
-        // With a limit the announced length or time holds even when the client has gone: the next
-        // write tells. A file, or a client that has gone, is always readable, so this then does not
-        // block and keeps the processor busy while the network is quiet; that is accepted.
-        if (readable.output && !drain_output(*capture) && until_client_goes)
+        if (readable.output && client_ends_capture(capture))
+            return End::STOPPED;
+        // A failure counts before the frames that came before it.
+        if (readable.packet_error && frame_source_failed(capture->source))
             return End::STOPPED;
         if (!readable.packet)
             continue;
 
-        Record &record = capture->record;
-        const ssize_t length = read(capture->socket_fd, record.frame.data(), record.frame.size());
-        if (length < 1)
-            return End::STOPPED;
-        const auto original_length = static_cast<uint32_t>(length);
-        // The cut holds for short frames, too (what follows them is left over from earlier ones):
-        // with it every record has the same size, and readers count on that.
-        const uint32_t captured_length =
-            capture->cut_length != 0 ? capture->cut_length : original_length;
-        if (!fits(*capture, captured_length))
-            return End::STOPPED;
-        if (!write_record(capture, captured_length, original_length))
-            return End::OUTPUT_BROKEN;
+        bool all = false;
+        const End end = copy_ready_frames(capture, &all);
+        if (end != End::NOT_YET)
+            return end;
+        const int64_t pause_us = all ? gathering_time(capture) : 0;
+        if (pause_us > 0) {
+            const timespec pause = {.tv_sec = 0, .tv_nsec = static_cast<long>(pause_us) * 1000};
+            (void)nanosleep(&pause, nullptr);
+        }
     }
 }
 
@@ -210,8 +299,8 @@ bool write_zeros(Capture *capture, uint32_t count) {
 
 // Fills the stream up to its size limit, if it has one.
 bool write_fillers(Capture *capture) {
-    while (capture->written < capture->size_limit) {
-        const auto remainder = static_cast<uint32_t>(capture->size_limit - capture->written);
+    while (capture->length < capture->size_limit) {
+        const auto remainder = static_cast<uint32_t>(capture->size_limit - capture->length);
         const uint32_t size = pcap_filler_size(remainder);
         if (size < PCAP_RECORD_HEADER_SIZE)  // a limit just above the size of the global header
             return write_zeros(capture, size);
@@ -230,36 +319,51 @@ int64_t write_stream(Capture *capture) {
     if (!write_counted(capture, header.data(), PCAP_GLOBAL_HEADER_SIZE))
         return -1;
     capture->start = uptime_seconds();
+    capture->uptime_asked_ms = -UPTIME_INTERVAL_MS;  // never
     const End end = copy_frames(capture);
     if (end == End::OUTPUT_BROKEN || (end == End::STOPPED && !write_fillers(capture)))
         return -1;
-    return capture->written;
+    return capture->length;
+}
+
+bool is_file(int fd) {
+    struct stat status;
+    return fstat(fd, &status) == 0 && S_ISREG(status.st_mode);
+}
+
+bool clock_is_fine() {
+    timespec resolution = {};
+    return clock_getres(CLOCK_MONOTONIC, &resolution) == 0 && resolution.tv_sec == 0 &&
+           resolution.tv_nsec <= COARSEST_CLOCK_NS;
 }
 
 }  // namespace
 
 int64_t capture_packets(const char *interface, int out_fd, uint32_t size_limit, uint32_t cut_length,
                         uint32_t time_limit, bool promiscuous, const sock_fprog *filter) {
-    const int opened = open_packet_socket(interface, filter);
+    Capture capture = {};
+    capture.block.reset(static_cast<uint8_t *>(malloc(BLOCK_SIZE)));
+    if (capture.block == nullptr)
+        return -ENOMEM;
+    const int opened = open_frame_source(interface, filter, &capture.source);
     if (opened < 0)
         return opened;
-    const UniqueFd socket_fd(opened);
+    capture.out_fd = out_fd;
+    capture.awaited_out_fd = out_fd;
+    capture.size_limit = size_limit;
+    capture.cut_length = std::min(cut_length, FRAME_SIZE);
+    capture.time_limit = time_limit;
+    capture.out_is_file = is_file(out_fd);
+    capture.may_pause = capture.source.ring.valid() && clock_is_fine();
 
-    set_promiscuous(socket_fd.get(), interface, promiscuous);
-    Capture capture = {.socket_fd = socket_fd.get(),
-                       .out_fd = out_fd,
-                       .size_limit = size_limit,
-                       .cut_length = std::min(cut_length, FRAME_SIZE),
-                       .time_limit = time_limit,
-                       .start = 0,
-                       .written = 0,
-                       .record = {}};
+    const int socket_fd = capture.source.socket_fd.get();
+    set_promiscuous(socket_fd, interface, promiscuous);
     const int64_t ret = write_stream(&capture);
 
     // Off even if it was on before: after an interrupted capture nobody else would switch it off.
-    set_promiscuous(socket_fd.get(), interface, false);
+    set_promiscuous(socket_fd, interface, false);
     int unused = 0;
-    (void)setsockopt(socket_fd.get(), SOL_SOCKET, SO_DETACH_FILTER, &unused, sizeof unused);
+    (void)setsockopt(socket_fd, SOL_SOCKET, SO_DETACH_FILTER, &unused, sizeof unused);
     return ret;
 }
 

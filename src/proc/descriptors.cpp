@@ -1,51 +1,93 @@
 #include "proc/descriptors.h"
 
+#include <fcntl.h>
+#include <pthread.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <unistd.h>
 
-#include <memory>
-
+#include "proc/known_sockets.h"
+#include "proc/socket_diag.h"
+#include "proc/socket_snapshot.h"
 #include "proc/socket_tables.h"
+#include "proc/table_lines.h"
+#include "util/line_text.h"
 #include "util/unique_fd.h"
 
 namespace {
 
-struct CloseFile {
-    void operator()(FILE *file) const { (void)fclose(file); }
-};
-using UniqueFile = std::unique_ptr<FILE, CloseFile>;
-
-using MatchLine = int (*)(const char *line, unsigned long inode, char *buf, size_t size);
-
-struct SocketTable {
-    const char *name;
-    MatchLine match;
-};
-
-// In the order in which they are searched.
-constexpr SocketTable SOCKET_TABLES[] = {
-    {"tcp", match_tcp_line},
-    {"tcp6", match_tcp6_line},
-    {"unix", match_unix_line},
-};
+bool find_tcp_socket(const char *net_dir, unsigned long inode, TcpSocket *socket) {
+    return find_line(net_dir, SocketTable::TCP,
+                     [&](const char *line) { return parse_tcp_line(line, inode, socket); }) ||
+           find_line(net_dir, SocketTable::TCP6,
+                     [&](const char *line) { return parse_tcp6_line(line, inode, socket); });
+}
 
 // The result of the first line that matches, or NO_MATCH.
-int search_table(const char *path, MatchLine match, unsigned long inode, char *buf, size_t size) {
-    UniqueFile file(fopen(path, "re"));
-    if (file == nullptr)
-        return NO_MATCH;
-    char line[SOCKET_LINE_SIZE];
-    while (fgets(line, sizeof line, file.get()) != nullptr) {
-        int length = match(line, inode, buf, size);
-        if (length != NO_MATCH)
-            return length;
+int search_unix_table(const char *net_dir, unsigned long inode, char *buf, size_t size) {
+    int length = NO_MATCH;
+    (void)find_line(net_dir, SocketTable::UNIX, [&](const char *line) {
+        length = match_unix_line(line, inode, buf, size);
+        return length != NO_MATCH;
+    });
+    return length;
+}
+
+// The directory of the process whose descriptors were asked for last: a link is read faster below
+// it than by its whole path.
+pthread_mutex_t last_lock = PTHREAD_MUTEX_INITIALIZER;
+pid_t last_pid = -1;
+int last_dir = -1;  // /proc/LAST_PID/fd, or -1: only a process that is asked for twice has it
+
+void close_last_dir() {
+    if (last_dir != -1)
+        (void)close(last_dir);
+    last_dir = -1;
+}
+
+// The target of a link in the kept directory; -1 also when that is another process's.
+ssize_t read_kept_link(pid_t pid, const char *name, const char *dir, char *buf, size_t size) {
+    (void)pthread_mutex_lock(&last_lock);
+    if (pid != last_pid) {
+        close_last_dir();
+        last_pid = pid;
+    } else if (last_dir == -1) {
+        last_dir = open(dir, O_PATH | O_DIRECTORY | O_CLOEXEC);
     }
-    return NO_MATCH;
+    ssize_t n = last_dir != -1 ? readlinkat(last_dir, name, buf, size) : -1;
+    (void)pthread_mutex_unlock(&last_lock);
+    return n;
+}
+
+ssize_t read_fd_link(pid_t pid, int fd, char *buf, size_t size) {
+    char name[16];
+    LineText name_text(name, sizeof name);
+    name_text.add_decimal(fd);
+    char path[64];
+    LineText text(path, sizeof path);
+    text.add_text("/proc/");
+    text.add_decimal(pid);
+    text.add_text("/fd");
+    ssize_t n = read_kept_link(pid, name, path, buf, size);
+    if (n >= 0)
+        return n;
+    // Also where the directory is that of a process that has gone and whose number is another's
+    // now.
+    text.add_char('/');
+    text.add_text(name);
+    return readlink(path, buf, size);
 }
 
 }  // namespace
+
+void forget_last_process() {
+    (void)pthread_mutex_lock(&last_lock);
+    close_last_dir();
+    last_pid = -1;
+    (void)pthread_mutex_unlock(&last_lock);
+    close_diag();
+}
 
 int list_fds(pid_t pid, int *fds, int max) {
     char path[64];
@@ -64,32 +106,53 @@ int list_fds(pid_t pid, int *fds, int max) {
     return count;
 }
 
-int describe_fd(pid_t pid, int fd, char *buf, size_t size) {
-    char path[128];
-    (void)snprintf(path, sizeof path, "/proc/%ld/fd/%d", static_cast<long>(pid), fd);
-    ssize_t n = readlink(path, buf, size - 1);
+int describe_fd(pid_t pid, int fd, char *buf, size_t size, SocketSnapshot *sockets) {
+    ssize_t n = read_fd_link(pid, fd, buf, size - 1);
     if (n < 1)
         return static_cast<int>(n);
     buf[n] = '\0';
     int length = static_cast<int>(n);
     if (strncmp(buf, "socket:[", 8) == 0) {
         unsigned long inode = strtoul(buf + 8, nullptr, 10);
-        length += describe_socket_inode(pid, inode, buf + n, size - static_cast<size_t>(n));
+        char *text = buf + n;
+        size_t room = size - static_cast<size_t>(n);
+        int found = sockets != nullptr ? sockets->describe(inode, text, room) : NO_MATCH;
+        length += found != NO_MATCH ? found : describe_socket_inode(pid, inode, text, room);
     }
     return length;
 }
 
 int describe_socket_inode(pid_t, unsigned long inode, char *buf, size_t size) {
-    return describe_socket_inode_in("/proc/net", inode, buf, size);
+    constexpr char NET_DIR[] = "/proc/net";
+    if (!sockets_can_be_known())
+        return describe_socket_inode_in(NET_DIR, inode, buf, size);
+    int length = describe_known_socket(inode, buf, size);
+    if (length != NO_MATCH)
+        return length;
+
+    TcpSocket socket;
+    if (find_tcp_socket(NET_DIR, inode, &socket)) {
+        remember_tcp_socket(inode, socket);
+        return format_tcp_socket(socket, buf, size);
+    }
+    // The name is asked for first: if it changes before the table is read, what is remembered does
+    // not hold any more, and the table is read again.
+    char name[SOCKET_LINE_SIZE];
+    char text[SOCKET_LINE_SIZE] = "";
+    int name_length = diag_unix_name(inode, name, sizeof name);
+    length = search_unix_table(NET_DIR, inode, text, sizeof text);
+    if (length == NO_MATCH)
+        return 0;
+    remember_unix_socket(inode, name, name_length, text);
+    if (length > 0)
+        (void)snprintf(buf, size, "%s", text);
+    return length;
 }
 
 int describe_socket_inode_in(const char *net_dir, unsigned long inode, char *buf, size_t size) {
-    for (const SocketTable &table : SOCKET_TABLES) {
-        char path[128];
-        (void)snprintf(path, sizeof path, "%s/%s", net_dir, table.name);
-        int length = search_table(path, table.match, inode, buf, size);
-        if (length != NO_MATCH)
-            return length;
-    }
-    return 0;
+    TcpSocket socket;
+    if (find_tcp_socket(net_dir, inode, &socket))
+        return format_tcp_socket(socket, buf, size);
+    int length = search_unix_table(net_dir, inode, buf, size);
+    return length != NO_MATCH ? length : 0;
 }

@@ -6,6 +6,8 @@
 #include <stddef.h>
 #include <sys/types.h>
 
+#include "proc/socket_snapshot.h"
+
 // Stores the numbers of the open descriptors of `pid` in `fds`, in the order of /proc/PID/fd and at
 // most `max`, and returns how many; 0 when they cannot be listed.
 int list_fds(pid_t pid, int *fds, int max);
@@ -15,7 +17,13 @@ int list_fds(pid_t pid, int *fds, int max);
 //
 // Returns the length of the whole text, which may be more than fitted: rely on the terminator. -1
 // when the link cannot be read, and then `buf` is left alone.
-int describe_fd(pid_t pid, int fd, char *buf, size_t size);
+//
+// With `sockets`, sockets are looked up there, which is for many descriptors at one moment.
+//
+// Keeps descriptors to be quick for the same process, and for sockets, again; forget_last_process
+// closes them.
+int describe_fd(pid_t pid, int fd, char *buf, size_t size, SocketSnapshot *sockets = nullptr);
+void forget_last_process();
 
 // Writes the connection of the socket with the inode number `inode`, found in the socket tables of
 // the caller's own network namespace (`pid` does not matter), into `buf` of `size` bytes:

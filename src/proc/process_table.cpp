@@ -7,15 +7,23 @@
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
+
+#include "util/line_text.h"
 #include "util/unique_fd.h"
 
 namespace {
 
 constexpr size_t PATH_SIZE = 128;
-constexpr size_t STAT_SIZE = 256;
 constexpr size_t NAME_SIZE = 1024;
+constexpr size_t LISTING_SIZE = 8192;  // of some 300 descriptors
+
+// To ask for a number that is free takes what is saved with about four that are in use.
+constexpr int FREE_NUMBER_SHARE = 4;
+constexpr int ALL_COUNTED = -1;
 
 pid_t ignore_pid = -1;
 
@@ -23,19 +31,22 @@ void format_proc_path(char (&path)[PATH_SIZE], const char *root, pid_t pid, cons
     (void)snprintf(path, sizeof path, "%s/%ld/%s", root, static_cast<long>(pid), file);
 }
 
-// Reads a file of process `pid` into `buf` as a terminated text, cut to `len` - 1 bytes. False when
-// there is nothing to read.
-bool read_proc_text(const char *root, pid_t pid, const char *file, char *buf, size_t len) {
+// Reads a file of process `pid` into `buf`. Returns the number of bytes, 0 when there is nothing to
+// read.
+size_t read_proc_file(const char *root, pid_t pid, const char *file, char *buf, size_t len) {
     char path[PATH_SIZE];
-    struct stat status;
     format_proc_path(path, root, pid, file);
-    if (stat(path, &status) != 0)
-        return false;
     ssize_t n = read_file(path, buf, len);
-    if (n < 1)
+    return n > 0 ? static_cast<size_t>(n) : 0;
+}
+
+// Likewise, as a terminated text that is cut to `len` - 1 bytes. False when there is nothing to
+// read.
+bool read_proc_text(const char *root, pid_t pid, const char *file, char *buf, size_t len) {
+    size_t n = read_proc_file(root, pid, file, buf, len);
+    if (n == 0)
         return false;
-    size_t length = static_cast<size_t>(n);
-    buf[length < len ? length : len - 1] = '\0';
+    buf[std::min(n, len - 1)] = '\0';
     return true;
 }
 
@@ -59,24 +70,58 @@ void count_target(const char *target, DescriptorCounts *counts) {
         ++counts->pipes;
 }
 
-// Counts the descriptors in `dir` from where it stands. Returns false when one of them was closed
-// meanwhile.
-bool count_entries(DIR *dir, bool read_links, DescriptorCounts *counts) {
-    while (const dirent *entry = readdir(dir)) {
-        if (entry->d_name[0] == '.')
-            continue;
-        ++counts->all;
-        if (!read_links)
-            continue;
-        char target[128];
-        ssize_t n = readlinkat(dirfd(dir), entry->d_name, target, sizeof target - 1);
-        if (n < 0 && errno == ENOENT)
-            return false;
-        // Links that may not be read stay so: beginning again for them would never end.
-        target[n > 0 ? n : 0] = '\0';
-        count_target(target, counts);
-    }
+// Counts what kind of descriptor `name` of the directory `dir` is. Returns false when there is
+// none.
+bool count_kind(int dir, const char *name, DescriptorCounts *counts) {
+    char target[128];
+    ssize_t n = readlinkat(dir, name, target, sizeof target - 1);
+    if (n < 0 && errno == ENOENT)
+        return false;
+    // Links that may not be read stay so: beginning again for them would never end.
+    target[n > 0 ? n : 0] = '\0';
+    count_target(target, counts);
     return true;
+}
+
+// Counts the descriptors in the directory `dir` by their numbers, from 0 on, which saves listing
+// them: where the kernel tells how many there are (as the size of the directory, since Linux 6.2),
+// and as long as few numbers are free. Returns the number from which on a listing has to tell, or
+// ALL_COUNTED.
+int count_numbers(int dir, DescriptorCounts *counts) {
+    struct stat status;
+    if (fstat(dir, &status) != 0 || status.st_size == 0)
+        return 0;
+    long used = 0;
+    int fd = 0;
+    while (used < status.st_size && fd - used <= status.st_size / FREE_NUMBER_SHARE) {
+        char name[16];
+        LineText(name, sizeof name).add_decimal(fd++);
+        if (count_kind(dir, name, counts))
+            ++used;
+    }
+    counts->all += static_cast<int>(used);
+    return used < status.st_size ? fd : ALL_COUNTED;
+}
+
+// Counts the descriptors from number `first` on in the directory `dir`, from where it stands.
+// Returns false when one of them was closed meanwhile, or the process has gone. (No directory
+// stream, which would cost an allocation and a call more than one that is read in one piece.)
+bool count_entries(int dir, int first, bool read_links, DescriptorCounts *counts) {
+    alignas(dirent64) char listing[LISTING_SIZE];
+    for (;;) {
+        const long length = syscall(SYS_getdents64, dir, listing, sizeof listing);
+        if (length <= 0)
+            return length == 0 || errno != ENOENT;
+        for (long at = 0; at < length;) {
+            const dirent64 *entry = reinterpret_cast<const dirent64 *>(listing + at);
+            at += entry->d_reclen;
+            if (entry->d_name[0] == '.' || strtol(entry->d_name, nullptr, 10) < first)
+                continue;
+            ++counts->all;
+            if (read_links && !count_kind(dir, entry->d_name, counts))
+                return false;
+        }
+    }
 }
 
 }  // namespace
@@ -128,6 +173,26 @@ int pid_name(pid_t pid, char *buf, size_t len) {
     return proc_name("/proc", pid, buf, len);
 }
 
+int proc_name_and_parent(const char *root, pid_t pid, char *buf, size_t len, pid_t *parent) {
+    *parent = -1;
+    bool named = read_proc_text(root, pid, "cmdline", buf, len) && name_from_cmdline(buf);
+    char text[STAT_SIZE + 1];
+    size_t n = read_proc_file(root, pid, "stat", text, STAT_SIZE);
+    if (n == 0)
+        return named;
+    text[n] = '\0';
+    pid_t ppid = ppid_from_stat(text);
+    if (!named) {
+        n = std::min(n, len - 1);
+        memcpy(buf, text, n);
+        buf[n] = '\0';
+        named = name_from_stat(buf);
+    }
+    if (named)
+        *parent = ppid;
+    return named;
+}
+
 void set_ignore_pid(pid_t pid) {
     ignore_pid = pid;
 }
@@ -175,11 +240,9 @@ int is_kernel_thread(pid_t pid) {
 }
 
 pid_t proc_ppid(pid_t pid) {
-    char path[PATH_SIZE];
     char text[STAT_SIZE + 1];
-    format_proc_path(path, "/proc", pid, "stat");
-    ssize_t n = read_file(path, text, STAT_SIZE);
-    if (n < 1)
+    size_t n = read_proc_file("/proc", pid, "stat", text, STAT_SIZE);
+    if (n == 0)
         return -1;
     text[n] = '\0';
     return ppid_from_stat(text);
@@ -208,16 +271,19 @@ int count_fds(pid_t pid, int *sockets, int *pipes) {
     format_proc_path(path, "/proc", pid, "fd");
     bool read_links = sockets != nullptr || pipes != nullptr;
     DescriptorCounts counts;
+    bool by_number = read_links;
     bool complete;
     do {
-        UniqueDir dir(opendir(path));
-        if (dir == nullptr) {
+        UniqueFd dir(open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        if (!dir.valid()) {
             counts = {};
             break;
         }
+        const int first = by_number ? count_numbers(dir.get(), &counts) : 0;
         // Begun again, what had been counted so far stays and is counted once more: callers know
         // the count of a busy table as one on the high side.
-        complete = count_entries(dir.get(), read_links, &counts);
+        by_number = false;
+        complete = first == ALL_COUNTED || count_entries(dir.get(), first, read_links, &counts);
     } while (!complete);
     if (sockets != nullptr)
         *sockets = counts.sockets;

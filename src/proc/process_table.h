@@ -8,6 +8,8 @@
 #include <stddef.h>
 #include <sys/types.h>
 
+constexpr size_t STAT_SIZE = 256;  // bytes of a stat file that are looked at for the parent
+
 // Opens `path`, makes one read of at most `len` bytes and closes it. Returns the number of bytes
 // read, or -1 if the file could not be opened or read. The text is not terminated.
 ssize_t read_file(const char *path, char *buf, size_t len);
@@ -20,6 +22,10 @@ int proc_name(const char *root, pid_t pid, char *buf, size_t len);
 
 // proc_name in "/proc".
 int pid_name(pid_t pid, char *buf, size_t len);
+
+// proc_name, with a `len` of at most STAT_SIZE, and the parent as proc_ppid tells it (-1 when there
+// is no name) in `parent`, for whoever wants both of many processes: reads the stat file once.
+int proc_name_and_parent(const char *root, pid_t pid, char *buf, size_t len, pid_t *parent);
 
 // Names a process that list_pids leaves out from now on; -1, as at the start, for none. Set once at
 // start-up, before there are threads.

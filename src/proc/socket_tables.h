@@ -8,12 +8,36 @@
 #pragma once
 
 #include <stddef.h>
+#include <stdint.h>
 
 constexpr int NO_MATCH = -1;
 
 // Lines are read in pieces of at most this many bytes, terminator included, and matched piece by
 // piece.
 constexpr size_t SOCKET_LINE_SIZE = 256;
+
+// What a line of a TCP table says.
+struct TcpSocket {
+    bool ipv6;
+    uint32_t local[4];  // addresses as they lie in memory, in network order; IPv4 has one word
+    uint32_t remote[4];
+    unsigned long local_port;
+    unsigned long remote_port;
+    unsigned long state;  // numbered as in include/net/tcp_states.h
+};
+
+// Takes a line of /proc/net/tcp or tcp6 apart, if it is that of the socket `inode`.
+bool parse_tcp_line(const char *line, unsigned long inode, TcpSocket *socket);
+bool parse_tcp6_line(const char *line, unsigned long inode, TcpSocket *socket);
+
+// The text for `socket`. Returns the length of the whole text, which may be more than fitted.
+int format_tcp_socket(const TcpSocket &socket, char *buf, size_t size);
+
+// The tables, in the order in which they are searched.
+enum class SocketTable { TCP, TCP6, UNIX };
+
+// The inode number in a line of `table`. False when there is none in its place.
+bool line_inode(SocketTable table, const char *line, unsigned long *inode);
 
 // A line of /proc/net/tcp: "[10.0.0.2:80 -> 10.0.0.9:51334][TCP_ESTABLISHED]".
 int match_tcp_line(const char *line, unsigned long inode, char *buf, size_t size);
@@ -23,3 +47,6 @@ int match_tcp6_line(const char *line, unsigned long inode, char *buf, size_t siz
 
 // A line of /proc/net/unix: "[/run/app.sock]", or 0 and nothing for a socket without a path.
 int match_unix_line(const char *line, unsigned long inode, char *buf, size_t size);
+
+// One of the three.
+int match_line(SocketTable table, const char *line, unsigned long inode, char *buf, size_t size);

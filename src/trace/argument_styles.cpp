@@ -7,6 +7,9 @@
 #include <string.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <charconv>
+
 #include "proc/descriptors.h"
 #include "util/line_text.h"
 #include "util/stream.h"
@@ -56,6 +59,38 @@ int peek_byte(const Tracee &tracee, unsigned long address, unsigned char *byte) 
     return 0;
 }
 
+// The bytes of a string, of which most are read at once. What comes out is what peeks alone would
+// give: one word for each byte, so that a string that ends less than a word before unreadable
+// memory loses its last bytes.
+class StringBytes {
+  public:
+    StringBytes(const Tracee &tracee, unsigned long address, long limit)
+        : tracee_(tracee), address_(address) {
+        const auto word_size = static_cast<long>(tracee.backend->abi->word_bits / 8);
+        if (tracee.backend->read_block == nullptr)
+            return;
+        const ssize_t got =
+            tracee.backend->read_block(tracee.pid, unsigned_word(*tracee.backend->abi, address),
+                                       block_, static_cast<size_t>(limit + word_size - 1));
+        known_ = got - word_size + 1;
+    }
+
+    // The bytes before this position, at most `limit`, are in block(), the others are to be peeked.
+    long known() const { return known_; }
+    const unsigned char *block() const { return block_; }
+
+    // The byte at position `i`. -1 when it cannot be read.
+    int peek(long i, unsigned char *byte) const {
+        return peek_byte(tracee_, address_ + static_cast<unsigned long>(i), byte);
+    }
+
+  private:
+    const Tracee &tracee_;
+    unsigned long address_;
+    long known_ = 0;  // the bytes of the block whose words are in it
+    unsigned char block_[WHOLE_STRING_MAX + sizeof(unsigned long) - 1];
+};
+
 // The 32-bit number at `address`; -1, like any other -1, when it cannot be read.
 int32_t peek_int(const Tracee &tracee, unsigned long address) {
     unsigned long word = 0;
@@ -64,27 +99,31 @@ int32_t peek_int(const Tracee &tracee, unsigned long address) {
     return static_cast<int32_t>(word);
 }
 
-void add_string_char(LineText *line, unsigned char c) {
-    if (c == '\n')
-        line->add("\\n");
-    else if (c == '\r')
-        line->add("\\r");
-    else if (c == '\t')
-        line->add("\\t");
-    else if (c >= ' ' && c <= '~')
-        line->add_char(static_cast<char>(c));
-    else
-        line->add("\\x%x", c);
+constexpr size_t LONGEST_CHAR = 4;  // "\xff"
+
+bool is_printable(unsigned char c) {
+    return c >= ' ' && c <= '~';
+}
+
+// Writes the text for a character that is not printable at `out`; returns the end of it.
+char *put_escaped(char *out, unsigned char c) {
+    *out++ = '\\';
+    if (c == '\n' || c == '\r' || c == '\t') {
+        *out++ = c == '\n' ? 'n' : c == '\r' ? 'r' : 't';
+        return out;
+    }
+    *out++ = 'x';
+    return std::to_chars(out, out + 2, c, 16).ptr;
 }
 
 void add_ptrace_request(LineText *line, const SyscallAbi &abi, unsigned long request) {
     for (const RequestRow &row : PTRACE_REQUESTS) {
         if (row.request == request) {
-            line->add("%s", row.name);
+            line->add_text(row.name);
             return;
         }
     }
-    line->add("%ld", signed_word(abi, request));
+    line->add_decimal(signed_word(abi, request));
 }
 
 // Adds the value that the directive at `directive`, behind its '%', asks for. Returns the number of
@@ -96,16 +135,16 @@ int add_value(LineText *line, const Tracee &tracee, const char *directive,
     const unsigned long value = value_at(1);
     switch (directive[0]) {
         case 'd':
-            line->add("%ld", signed_word(abi, value));
+            line->add_decimal(signed_word(abi, value));
             break;
         case 'u':
-            line->add("%lu", unsigned_word(abi, value));
+            line->add_unsigned(unsigned_word(abi, value));
             break;
         case 'x':
-            line->add("%lx", unsigned_word(abi, value));
+            line->add_hex(unsigned_word(abi, value));
             break;
         case 'h':
-            line->add("%x", static_cast<unsigned>(value));
+            line->add_hex(static_cast<unsigned>(value));
             break;
         case 'r':
             add_ptrace_request(line, abi, value);
@@ -137,10 +176,12 @@ int format_fd_arg(const Tracee &tracee, char *buf, size_t size, unsigned long fd
     char description[128];
     LineText line(buf, size);
     // The length that is returned may be more than fitted: the terminator counts.
-    if (describe_fd(tracee.pid, number, description, sizeof(description)) < 1)
-        line.add("%d", number);
-    else
-        line.add("%d %s", number, description);
+    const bool known = describe_fd(tracee.pid, number, description, sizeof(description)) >= 1;
+    line.add_decimal(number);
+    if (known) {
+        line.add_char(' ');
+        line.add_text(description);
+    }
     return line.length();
 }
 
@@ -151,20 +192,29 @@ int format_string_arg(const Tracee &tracee, char *buf, size_t size, unsigned lon
     if (len == ZERO_TERMINATED || len >= 1) {
         const bool cut = len == ZERO_TERMINATED || len > WHOLE_STRING_MAX;
         const long limit = cut ? CUT_STRING_LENGTH : len;
-        for (long i = 0; i < limit; i++) {
-            unsigned char c;
-            // One word for each byte, so a string that ends less than a word before unreadable
-            // memory loses its last bytes.
-            if (peek_byte(tracee, address + static_cast<unsigned long>(i), &c) < 0)
-                break;
-            // Room is kept for a character, the closing quote and the terminator. The longest form
-            // of a character takes more: then the closing quote is what does not fit.
-            if (static_cast<size_t>(line.length()) + 3 >= size)
-                break;
-            if (c == '\0' && len == ZERO_TERMINATED)
-                break;
-            add_string_char(&line, c);
-        }
+        const StringBytes bytes(tracee, address, limit);
+        const long known = bytes.known();
+        char text[WHOLE_STRING_MAX * LONGEST_CHAR];
+        char *end = text;
+        // Room is kept for the opening quote, a character, the closing quote and the terminator.
+        // The longest form of a character takes more: then the closing quote is what does not fit.
+        const char *full = text + std::min(size > 4 ? size - 4 : 0, sizeof(text));
+        const auto add = [&end, full, len](unsigned char c) {
+            if (end >= full || (c == '\0' && len == ZERO_TERMINATED))
+                return false;
+            if (is_printable(c))
+                *end++ = static_cast<char>(c);
+            else
+                end = put_escaped(end, c);
+            return true;
+        };
+        long i = 0;
+        while (i < known && add(bytes.block()[i]))
+            i++;
+        unsigned char c = 0;
+        while (i >= known && i < limit && bytes.peek(i, &c) == 0 && add(c))
+            i++;
+        line.add_bytes(text, static_cast<size_t>(end - text));
     }
     line.add_char('"');
     return line.length();
@@ -187,9 +237,7 @@ int format_arguments(const Tracee &tracee, char *buf, size_t size, const char *p
             p++;
             p += add_value(&line, tracee, p, values);
         } else {
-            const int plain = static_cast<int>(strcspn(p, "%"));
-            line.add("%.*s", plain, p);
-            p += plain;
+            line.add_char(*p++);
         }
     }
     return line.length();

@@ -49,7 +49,15 @@ struct TraceBackend {
     // Reads the word at `address`, which need not be aligned, of the tracee's memory. -1 with errno
     // set when any of its bytes cannot be read.
     int (*peek)(pid_t pid, unsigned long address, unsigned long *word);
+
+    // Reads at most `len` bytes at `address` into `buf` with one system call and returns how many
+    // came, or -1. Bytes that can be peeked may be missing from the first one on that is hard to
+    // read. Null where there is no such call.
+    ssize_t (*read_block)(pid_t pid, unsigned long address, void *buf, size_t len);
 };
+
+// read_block for every machine; -1 on kernels before 3.2.
+ssize_t read_tracee_block(pid_t pid, unsigned long address, void *buf, size_t len);
 
 extern const TraceBackend MIPS_BACKEND;
 #if defined(__x86_64__)

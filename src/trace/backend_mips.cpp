@@ -8,16 +8,13 @@
 
 namespace {
 
-// Places in TraceRegisters. Those of the general registers are their numbers, by which
-// PTRACE_PEEKUSER knows them as well.
+// Places in TraceRegisters, which is what PTRACE_GETREGS fills. Those of the general registers are
+// their numbers, by which PTRACE_PEEKUSER and PTRACE_POKEUSER know them as well.
 constexpr unsigned REG_V0 = 2;
 constexpr unsigned REG_A0 = 4;
 constexpr unsigned REG_SP = 29;
 constexpr unsigned REG_RA = 31;
 constexpr unsigned SLOT_EPC = 34;
-
-// The number of the program counter for PTRACE_PEEKUSER.
-constexpr unsigned long USER_PC = 64;
 
 constexpr unsigned REGISTER_ARGUMENTS = 4;  // a0 to a3; the other two are on the stack
 
@@ -43,16 +40,23 @@ unsigned long peek_stack_argument(pid_t pid, const TraceRegisters &regs, unsigne
     return static_cast<uint32_t>(mips_ptrace(PTRACE_PEEKDATA, pid, stack_argument(regs, i), 0));
 }
 
+// The two stack arguments, which lie side by side.
+void read_stack_arguments(pid_t pid, const TraceRegisters &regs, unsigned long *first,
+                          unsigned long *second) {
+    uint32_t words[2];
+    if (read_tracee_block(pid, stack_argument(regs, 0), words, sizeof words) == sizeof words) {
+        *first = words[0];
+        *second = words[1];
+        return;
+    }
+    *first = peek_stack_argument(pid, regs, 0);
+    *second = peek_stack_argument(pid, regs, 1);
+}
+
+// All registers at once; the kernel sign-extends them.
 int read_entry(pid_t pid, TraceRegisters *regs) {
-    if (mips_ptrace(PTRACE_GETREGS, pid, 0, reinterpret_cast<unsigned long>(regs->slot)) < 0)
-        return -1;
-    regs->slot[REG_V0] = peek_user(pid, REG_V0);
-    for (unsigned i = 0; i < REGISTER_ARGUMENTS; i++)
-        regs->slot[REG_A0 + i] = peek_user(pid, REG_A0 + i);
-    regs->slot[REG_SP] = peek_user(pid, REG_SP);
-    regs->slot[REG_RA] = peek_user(pid, REG_RA);
-    regs->slot[SLOT_EPC] = peek_user(pid, USER_PC);
-    return 0;
+    const auto slots = reinterpret_cast<unsigned long>(regs->slot);
+    return mips_ptrace(PTRACE_GETREGS, pid, 0, slots) < 0 ? -1 : 0;
 }
 
 // What both stops show: the registers as at the entry, and the stack words as they are now.
@@ -63,8 +67,7 @@ void entry_record(pid_t pid, const TraceRegisters &regs, SyscallRecord *record) 
     record->number = word(REG_V0);
     for (unsigned i = 0; i < REGISTER_ARGUMENTS; i++)
         record->arg[i] = word(REG_A0 + i);
-    record->arg[4] = peek_stack_argument(pid, regs, 0);
-    record->arg[5] = peek_stack_argument(pid, regs, 1);
+    read_stack_arguments(pid, regs, &record->arg[4], &record->arg[5]);
     record->result = record->number;
     record->writeback = 0;
 }
@@ -109,6 +112,7 @@ const TraceBackend MIPS_BACKEND = {
     .exit_record = exit_record,
     .write_back = write_back,
     .peek = peek,
+    .read_block = read_tracee_block,
 };
 
 #if defined(__mips__)

@@ -79,8 +79,17 @@ int format_syscall(TraceRequest *request, bool at_entry, const char *name, pid_t
         name = socketcall_name(record->arg[0]);
 
     LineText line(buf, size);
-    line.add("[%d %s] [%lx %lx] %s(", pid, procname, unsigned_word(abi, record->pc),
-             unsigned_word(abi, record->ra), name != nullptr ? name : "(null)");
+    line.add_char('[');
+    line.add_decimal(pid);
+    line.add_char(' ');
+    line.add_text(procname);
+    line.add_text("] [");
+    line.add_hex(unsigned_word(abi, record->pc));
+    line.add_char(' ');
+    line.add_hex(unsigned_word(abi, record->ra));
+    line.add_text("] ");
+    line.add_text(name != nullptr ? name : "(null)");
+    line.add_char('(');
 
     if (style == ArgStyle::SOCKETCALL) {
         // The sub-call's own arguments lie in a block at arg[1], but the line has always shown the
@@ -103,9 +112,13 @@ int format_syscall(TraceRequest *request, bool at_entry, const char *name, pid_t
 
     if (at_entry)
         return line.length();
-    if (row.hex_result)
-        line.add(" = 0x%lx\n", unsigned_word(abi, record->result));
-    else
-        line.add(" = %ld\n", signed_word(abi, record->result));
+    line.add_text(" = ");
+    if (row.hex_result) {
+        line.add_text("0x");
+        line.add_hex(unsigned_word(abi, record->result));
+    } else {
+        line.add_decimal(signed_word(abi, record->result));
+    }
+    line.add_char('\n');
     return line.length();
 }

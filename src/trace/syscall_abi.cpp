@@ -6,6 +6,7 @@
 
 #include <array>
 #include <iterator>
+#include <span>
 #include <string_view>
 
 namespace {
@@ -15,6 +16,34 @@ constexpr const char *MIPS_NAMES[] = {
 #include "trace/mips_syscall_names.inc"
 };
 static_assert(std::size(MIPS_NAMES) == 932);
+
+// The names one behind the other, and where each begins. A table of pointers would be adjusted by
+// the dynamic linker at every start, also of an applet that never looks at it.
+template <size_t COUNT, size_t LENGTH>
+struct NameTable {
+    std::array<char, LENGTH> text{};
+    std::array<uint16_t, COUNT> offsets{};
+
+    constexpr explicit NameTable(const char *const (&names)[COUNT]) {
+        size_t end = 0;
+        for (size_t i = 0; i < COUNT; i++) {
+            offsets[i] = static_cast<uint16_t>(end);
+            for (const char c : std::string_view(names[i]))
+                text[end++] = c;
+            end++;
+        }
+    }
+};
+
+constexpr size_t text_length(std::span<const char *const> names) {
+    size_t length = 0;
+    for (const char *name : names)
+        length += std::string_view(name).size() + 1;
+    return length;
+}
+static_assert(text_length(MIPS_NAMES) <= UINT16_MAX);
+
+constexpr NameTable<std::size(MIPS_NAMES), text_length(MIPS_NAMES)> MIPS_NAME_TABLE(MIPS_NAMES);
 
 // What socket_subcall gives for a call that is no socket call.
 constexpr uint8_t DEFAULT_SUBCALL = 2;
@@ -128,6 +157,10 @@ constexpr const char *X86_64_NAMES[] = {
 #include "native_syscall_names.inc"
 };
 
+static_assert(text_length(X86_64_NAMES) <= UINT16_MAX);
+constexpr NameTable<std::size(X86_64_NAMES), text_length(X86_64_NAMES)> X86_64_NAME_TABLE(
+    X86_64_NAMES);
+
 constexpr CallTable<std::size(X86_64_NAMES)> x86_64_call_table() {
     CallTable<std::size(X86_64_NAMES)> table;
     for (size_t i = 0; i < std::size(X86_64_NAMES); i++) {
@@ -157,7 +190,8 @@ const SyscallAbi MIPS_ABI = {
     .word_bits = 32,
     .first_number = MIPS_FIRST_NUMBER,
     .count = std::size(MIPS_NAMES),
-    .names = MIPS_NAMES,
+    .name_text = MIPS_NAME_TABLE.text.data(),
+    .name_offsets = MIPS_NAME_TABLE.offsets.data(),
     .styles = MIPS_CALLS.styles.data(),
     .subcalls = MIPS_CALLS.subcalls.data(),
     .signal_names = MIPS_SIGNALS,
@@ -168,7 +202,8 @@ const SyscallAbi X86_64_ABI = {
     .word_bits = 64,
     .first_number = 0,
     .count = std::size(X86_64_NAMES),
-    .names = X86_64_NAMES,
+    .name_text = X86_64_NAME_TABLE.text.data(),
+    .name_offsets = X86_64_NAME_TABLE.offsets.data(),
     .styles = X86_64_CALLS.styles.data(),
     .subcalls = X86_64_CALLS.subcalls.data(),
     .signal_names = X86_64_SIGNALS,
@@ -180,7 +215,7 @@ bool syscall_in_range(const SyscallAbi &abi, unsigned long number) {
 }
 
 const char *syscall_name(const SyscallAbi &abi, unsigned long number) {
-    return abi.names[number - abi.first_number];
+    return abi.name_text + abi.name_offsets[number - abi.first_number];
 }
 
 ArgStyle syscall_style(const SyscallAbi &abi, unsigned long number) {

@@ -35,10 +35,11 @@ enum class ArgStyle : uint8_t {
 
 // One machine's calls and signals.
 struct SyscallAbi {
-    unsigned word_bits;          // 32 or 64: what a register and a pointer of a tracee hold
-    unsigned long first_number;  // of the call in names[0]
-    unsigned long count;         // entries of `names`, and of `styles` and `subcalls`
-    const char *const *names;
+    unsigned word_bits;            // 32 or 64: what a register and a pointer of a tracee hold
+    unsigned long first_number;    // of the call that comes first in the tables
+    unsigned long count;           // entries of each
+    const char *name_text;         // all names, each terminated
+    const uint16_t *name_offsets;  // where in it each begins
     const ArgStyle *styles;
     const uint8_t
         *subcalls;  // the socketcall sub-call that each direct socket call stands for, else 2

@@ -62,10 +62,12 @@ int trace_printf(TraceRequest *request, const char *format, ...) {
 void trace_list_fds(TraceRequest *request, pid_t pid) {
     int fds[MAX_LISTED_FDS];
     const int count = list_fds(pid, fds, MAX_LISTED_FDS);
+    SocketSnapshot sockets;
     trace_printf(request, "\n[%d %s] %d open fds:\n", pid, trace_process_name(request, pid), count);
     for (int i = 0; i < count; i++) {
         trace_printf(request, "%d\t", fds[i]);
-        output_description(request, describe_fd(pid, fds[i], request->buf, request->buf_size));
+        output_description(request,
+                           describe_fd(pid, fds[i], request->buf, request->buf_size, &sockets));
         trace_printf(request, "\n");
     }
 }

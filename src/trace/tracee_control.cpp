@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include "proc/process_table.h"
+#include "util/children.h"
 
 namespace {
 
@@ -45,7 +46,7 @@ TraceeStatus tracee_status(pid_t pid) {
 
 // waitpid for a tracee, of any kind: without __WALL, kernels before 4.7 do not report threads.
 pid_t wait_tracee(pid_t pid, int *status, int options) {
-    return waitpid(pid, status, options | __WALL);
+    return wait_as_tracer(pid, status, options | __WALL);
 }
 
 // Waits for a stop or the end of the tracee `pid`, and through signals: if the wait ended with one,
@@ -95,34 +96,7 @@ bool is_job_control_signal(int sig) {
     return sig == SIGSTOP || sig == SIGTSTP || sig == SIGTTIN || sig == SIGTTOU;
 }
 
-}  // namespace
-
-int trace_attach(pid_t pid) {
-    if (ptrace(PTRACE_ATTACH, pid, nullptr, nullptr) == -1)
-        return -1;
-    bool interrupted = false;
-    pid_t waited;
-    for (;;) {
-        int status;
-        waited = wait_for_attach(pid, &status, &interrupted);
-        if (waited == -1 || !WIFSTOPPED(status))
-            break;
-        int sig = WSTOPSIG(status);
-        if (sig == SIGSTOP || trace_in_job_stop(pid, sig))
-            break;
-        // A signal of its own came first. It gets that one, and the SIGSTOP of the attach is waited
-        // for: taken later for a signal from outside, it would stop the process for good. A SIGTRAP
-        // at this point is the kernel's word of an execve, and no signal of the process.
-        if (signal_request(PTRACE_CONT, pid, sig == SIGTRAP ? 0 : sig) == -1)
-            break;
-    }
-    if (waited != -1 && !interrupted)
-        return waited;
-    trace_detach(pid);
-    return -1;
-}
-
-void trace_detach(pid_t pid, int sig) {
+void detach(pid_t pid, int sig) {
     if (signal_request(PTRACE_DETACH, pid, sig) != -1)
         return;
     // It runs, or it is not ours: ended and reaped, or replaced by an execve of another thread. A
@@ -152,6 +126,42 @@ void trace_detach(pid_t pid, int sig) {
         if (signal_request(PTRACE_CONT, pid, 0) == -1)
             return;
     }
+}
+
+}  // namespace
+
+int trace_attach(pid_t pid) {
+    const bool claimed = claim_child(pid);
+    if (ptrace(PTRACE_ATTACH, pid, nullptr, nullptr) == -1) {
+        if (claimed)
+            release_child(pid);
+        return -1;
+    }
+    bool interrupted = false;
+    pid_t waited;
+    for (;;) {
+        int status;
+        waited = wait_for_attach(pid, &status, &interrupted);
+        if (waited == -1 || !WIFSTOPPED(status))
+            break;
+        int sig = WSTOPSIG(status);
+        if (sig == SIGSTOP || trace_in_job_stop(pid, sig))
+            break;
+        // A signal of its own came first. It gets that one, and the SIGSTOP of the attach is waited
+        // for: taken later for a signal from outside, it would stop the process for good. A SIGTRAP
+        // at this point is the kernel's word of an execve, and no signal of the process.
+        if (signal_request(PTRACE_CONT, pid, sig == SIGTRAP ? 0 : sig) == -1)
+            break;
+    }
+    if (waited != -1 && !interrupted)
+        return waited;
+    trace_detach(pid);
+    return -1;
+}
+
+void trace_detach(pid_t pid, int sig) {
+    detach(pid, sig);
+    release_child(pid);
 }
 
 void trace_set_options(pid_t pid, unsigned long options) {

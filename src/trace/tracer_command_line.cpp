@@ -109,6 +109,7 @@ int trace_command(TraceRequest *request, char **command) {
         spawn_process_noenv(path.get(), command, STDIN_FILENO, STDOUT_FILENO, STDERR_FILENO, true);
     if (pid == -1)
         return 1;
+    forget_child(pid);  // this thread both traces it and waits for it
     // Not before the start: an ignored signal stays ignored in the command.
     (void)signal(SIGALRM, SIG_IGN);
     // The stop that the kernel makes at the execve. A command that could not be executed has ended

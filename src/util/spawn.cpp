@@ -1,11 +1,9 @@
 #include "util/spawn.h"
 
-#include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/ptrace.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 namespace {
@@ -38,7 +36,7 @@ void redirect(int given, int standard) {
 
 pid_t spawn_process(const char *path, char *const argv[], char *const envp[], int in_fd, int out_fd,
                     int err_fd, bool trace_me) {
-    pid_t pid = fork();
+    pid_t pid = fork_child(trace_me);
     if (pid == -1)
         perror("fork");
     if (pid == 0)
@@ -56,15 +54,7 @@ int run_process_wait(const char *path, char *const argv[], int in_fd, int out_fd
     int status = 1;
     pid_t pid = spawn_process(path, argv, nullptr, in_fd, out_fd, err_fd, trace_me);
     (void)wait_for_child(pid, &status);
+    if (trace_me)
+        forget_child(pid);  // it may only have stopped
     return (status >> 8) & 0xff;
-}
-
-pid_t wait_for_child(pid_t pid, int *status) {
-    if (pid == -1)
-        return -1;  // to waitpid that would be any child
-    pid_t waited;
-    do {
-        waited = waitpid(pid, status, 0);
-    } while (waited == -1 && errno == EINTR);
-    return waited;
 }

@@ -3,15 +3,17 @@
 
 #include <sys/types.h>
 
+#include "util/children.h"
+
 // Starts the executable `path` (a full path: PATH is not searched) with the null-terminated vectors
 // `argv` and `envp` (null: no environment). The three descriptors become 0, 1 and 2 of the child,
 // which also inherits everything else that is not marked close-on-exec; the caller keeps its own.
 // With `trace_me` the child becomes a ptrace tracee of the caller and stops with SIGTRAP at its
 // successful execve.
 //
-// Returns the child's pid, which the caller must reap, or -1 with "fork: ..." printed on standard
-// error. A program that cannot be executed is not a failure here: the child prints "execve: ..." on
-// `err_fd` and exits with 1.
+// Returns the child's pid, to be reaped with wait_for_child (or after forget_child), or -1 with
+// "fork: ..." printed on standard error. A program that cannot be executed is not a failure here:
+// the child prints "execve: ..." on `err_fd` and exits with 1.
 pid_t spawn_process(const char *path, char *const argv[], char *const envp[], int in_fd, int out_fd,
                     int err_fd, bool trace_me);
 
@@ -24,7 +26,3 @@ pid_t spawn_process_noenv(const char *path, char *const argv[], int in_fd, int o
 // first stop). Also 0 when it cannot be started or waited for.
 int run_process_wait(const char *path, char *const argv[], int in_fd, int out_fd, int err_fd,
                      bool trace_me);
-
-// Waits for the end of the child `pid`, resuming after signals. Returns what waitpid does: `pid`
-// with the wait status in `status` (which may be null), or -1, also for a `pid` of -1.
-pid_t wait_for_child(pid_t pid, int *status);

@@ -1,8 +1,12 @@
 # Makes of ${dir}/tests.txt the CTest entries of the tests, ${dir}/entries.cmake, and the list of
-# what the board has to run, ${dir}/run.txt. A system test is a process of its own there, and so is
-# a suite of unit tests: starting processes is what takes the time. Tests of ${here}/left_out.txt
-# are not run, but shown as skipped, with the reason there.
+# what the board has to run, ${dir}/groups.txt. Some tests of a program are one group, which shares a
+# process: starting one takes longer than most tests. A group is small enough that several boards
+# can share the work. Tests of ${here}/left_out.txt are not run, but shown as skipped, with the
+# reason there.
 cmake_minimum_required(VERSION 3.25)
+
+set(GROUP_SIZE 20)
+set(SYSTEM_GROUP_SIZE 4)  # these take longer
 
 file(STRINGS ${dir}/tests.txt tests)
 file(STRINGS ${here}/left_out.txt left_out REGEX "^[^#]")
@@ -23,32 +27,32 @@ function(left_out_reason result test)
 endfunction()
 
 set(entries "")
-set(processes "")
+set(groups "")
 foreach(test IN LISTS tests)
-  string(REGEX MATCH "^([^ ]+) (.*)\\.([^.]+)$" ignored "${test}")
+  string(REGEX MATCH "^([^ ]+) (.*)$" ignored "${test}")
   set(program ${CMAKE_MATCH_1})
-  set(suite ${CMAKE_MATCH_2})
-  set(name ${suite}.${CMAKE_MATCH_3})
-  if(program STREQUAL "system_tests")
-    set(process ${program}.${name})
-    set(filter ${name})
-  else()
-    set(process ${program}.${suite})
-    set(filter ${suite}.*)
-  endif()
-  string(REPLACE "/" "_" process "${process}")
+  set(name ${CMAKE_MATCH_2})
 
   left_out_reason(reason ${program}.${name})
   if(reason)
     set(arguments "--left-out [==[${reason}]==]")
-    list(APPEND left_out_${process} ${name})
   else()
-    set(arguments "[==[${dir}/results/${process}]==] [==[${name}]==]")
-    if(NOT process IN_LIST processes)
-      list(APPEND processes ${process})
-      set(program_${process} ${program})
-      set(filter_${process} ${filter})
+    set(size ${GROUP_SIZE})
+    if(program STREQUAL "system_tests")
+      set(size ${SYSTEM_GROUP_SIZE})
     endif()
+    if(NOT DEFINED count_${program})
+      set(count_${program} 0)
+    endif()
+    math(EXPR part "${count_${program}} / ${size} + 1")
+    math(EXPR count_${program} "${count_${program}} + 1")
+    set(group ${program}.${part})
+    if(NOT group IN_LIST groups)
+      list(APPEND groups ${group})
+      set(program_${group} ${program})
+    endif()
+    list(APPEND tests_${group} ${name})
+    set(arguments "[==[${dir}/share/results/${group}]==] [==[${name}]==]")
   endif()
   string(APPEND entries
     "add_test([==[device.${program}.${name}]==] [==[${here}/show_result]==] ${arguments})\n"
@@ -56,14 +60,10 @@ foreach(test IN LISTS tests)
     " FIXTURES_REQUIRED board SKIP_REGULAR_EXPRESSION [==[\\[  SKIPPED \\]]==])\n")
 endforeach()
 
-set(run "")
-foreach(process IN LISTS processes)
-  set(filter "${filter_${process}}")
-  if(left_out_${process})
-    list(JOIN left_out_${process} ":" others)
-    string(APPEND filter "-${others}")
-  endif()
-  string(APPEND run "${program_${process}} ${filter} ${process}\n")
+set(lines "")
+foreach(group IN LISTS groups)
+  list(JOIN tests_${group} " " names)
+  string(APPEND lines "${group} ${program_${group}} ${names}\n")
 endforeach()
 file(WRITE ${dir}/entries.cmake "${entries}")
-file(WRITE ${dir}/run.txt "${run}")
+file(WRITE ${dir}/groups.txt "${lines}")

@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <linux/blkpg.h>
+#include <linux/dm-ioctl.h>
 #include <linux/loop.h>
 #include <mtd/mtd-user.h>
 #include <stdio.h>
@@ -11,9 +12,12 @@
 #include <string.h>
 #include <sys/file.h>
 #include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <unistd.h>
 
 #include <utility>
+#include <vector>
 
 #include "support/run_program.h"
 #include "util/unique_fd.h"
@@ -53,6 +57,61 @@ bool take_loop_device(const std::string &path, int file, UniqueFd *ret) {
     }
     *ret = std::move(fd);
     return true;
+}
+
+// ---- Devices of the device mapper
+
+constexpr const char *MAPPER = "/dev/mapper/control";
+constexpr uint64_t SECTOR = 512;
+
+struct MappedDevice : LogDevice {
+    ~MappedDevice() override;
+    std::unique_ptr<LogDevice> below;
+    UniqueFd control;
+    std::string name;  // empty until the device exists
+};
+
+// One piece of a mapped device, in sectors.
+struct MapperTarget {
+    uint64_t begin;
+    uint64_t end;
+    const char *type;
+    std::string parameters;
+};
+
+// Puts `request` to the device mapper about the device `name`; `targets` is its new table, where
+// the request loads one. Returns the number of the device, or -1 with errno set.
+int64_t ask_mapper(int control, unsigned long request, const std::string &name,
+                   const std::vector<MapperTarget> &targets = {}) {
+    std::string table;
+    for (const MapperTarget &target : targets) {
+        std::string parameters = target.parameters + '\0';
+        parameters.resize((parameters.size() + 7) / 8 * 8);
+        dm_target_spec spec = {};
+        spec.sector_start = target.begin;
+        spec.length = target.end - target.begin;
+        spec.next = static_cast<uint32_t>(sizeof(spec) + parameters.size());
+        strcpy(spec.target_type, target.type);
+        table += std::string(reinterpret_cast<const char *>(&spec), sizeof(spec)) + parameters;
+    }
+    dm_ioctl head = {};
+    head.version[0] = 4;  // as it has been since Linux 2.6
+    head.data_start = sizeof(head);
+    head.target_count = static_cast<uint32_t>(targets.size());
+    strcpy(head.name, name.c_str());
+    std::string block(reinterpret_cast<const char *>(&head), sizeof(head));
+    block += table;
+    head.data_size = static_cast<uint32_t>(block.size());
+    memcpy(block.data(), &head, sizeof(head));
+    if (ioctl(control, request, block.data()) != 0)
+        return -1;
+    memcpy(&head, block.data(), sizeof(head));
+    return static_cast<int64_t>(head.dev);
+}
+
+MappedDevice::~MappedDevice() {
+    if (!name.empty() && ask_mapper(control.get(), DM_DEV_REMOVE, name) < 0)
+        ADD_FAILURE() << error_of("DM_DEV_REMOVE");
 }
 
 // ---- Flash
@@ -165,6 +224,55 @@ std::unique_ptr<LogDevice> make_loop_device(const std::string &file) {
     else
         device->reason = error_of(path);
     return device;
+}
+
+std::unique_ptr<LogDevice> make_failing_device(const std::string &file, off_t begin, off_t end) {
+    auto device = std::make_unique<MappedDevice>();
+    device->control.reset(open(MAPPER, O_RDWR | O_CLOEXEC));
+    if (!device->control.valid() && load_module("dm-mod"))
+        device->control.reset(open(MAPPER, O_RDWR | O_CLOEXEC));
+    if (!device->control.valid()) {
+        device->reason = error_of(MAPPER);
+        if (getenv("FIELDKIT_LOAD_MODULES") != nullptr)
+            ADD_FAILURE() << device->reason;
+        return device;
+    }
+    device->below = make_loop_device(file);
+    struct stat status;
+    if (device->below->path.empty() || stat(file.c_str(), &status) != 0) {
+        device->reason = device->below->reason;
+        return device;
+    }
+    const std::string &below = device->below->path;
+    const uint64_t from = static_cast<uint64_t>(begin) / SECTOR;
+    const uint64_t to = static_cast<uint64_t>(end) / SECTOR;
+    const std::vector<MapperTarget> table = {{0, from, "linear", below + " 0"},
+                                             {from, to, "error", ""},
+                                             {to, static_cast<uint64_t>(status.st_size) / SECTOR,
+                                              "linear", below + " " + std::to_string(to)}};
+    const std::string name = "oopslog-test-" + std::to_string(getpid());
+    const int control = device->control.get();
+    if (ask_mapper(control, DM_DEV_CREATE, name) < 0) {
+        device->reason = error_of("DM_DEV_CREATE");
+        return device;
+    }
+    device->name = name;
+    // To suspend without asking to is to resume, which puts the new table in force.
+    int64_t number = ask_mapper(control, DM_TABLE_LOAD, name, table);
+    if (number >= 0)
+        number = ask_mapper(control, DM_DEV_SUSPEND, name);
+    const std::string path = "/dev/dm-" + std::to_string(minor(static_cast<dev_t>(number)));
+    if (number >= 0 && wait_until([&] { return access(path.c_str(), F_OK) == 0; }))
+        device->path = path;
+    else
+        ADD_FAILURE() << error_of("device mapper");
+    return device;
+}
+
+bool fails_to_read(const std::string &device, off_t offset) {
+    const UniqueFd fd(open(device.c_str(), O_RDONLY | O_CLOEXEC));
+    char sector[SECTOR];
+    return pread(fd.get(), sector, sizeof(sector), offset) == -1 && errno == EIO;
 }
 
 std::unique_ptr<LogDevice> make_flash_device(const std::string &image, FlashNode node) {

@@ -17,6 +17,13 @@ class LogDevice {
 // A loop device over `file`. It goes with the object, or with the test's process.
 std::unique_ptr<LogDevice> make_loop_device(const std::string &file);
 
+// A device over `file` whose bytes from `begin` up to `end` (multiples of 512) cannot be read, made
+// with the kernel's device mapper.
+std::unique_ptr<LogDevice> make_failing_device(const std::string &file, off_t begin, off_t end);
+
+// Whether reading at `offset` is an input/output error, as such a device has them.
+bool fails_to_read(const std::string &device, off_t offset);
+
 enum class FlashNode { RAW, BLOCK };
 
 // A partition with these contents on emulated flash (the kernel's mtdram), as raw flash or as the

@@ -226,10 +226,13 @@ std::string fixture_path(const std::string &name) {
 
 bool wait_until(const std::function<bool()> &condition, int timeout_s) {
     long deadline = now_ms() + timeout_s * 1000;
+    // Short waits end at once; long ones leave the processor to what they wait for.
+    useconds_t pause = 1000;
     while (!condition()) {
         if (now_ms() > deadline)
             return false;
-        usleep(2000);
+        usleep(pause);
+        pause = pause < 16000 ? pause + pause / 4 : 20000;
     }
     return true;
 }

@@ -14,6 +14,8 @@
 
 #include <filesystem>
 #include <set>
+#include <utility>
+#include <vector>
 
 #include "support/run_program.h"
 #include "support/temp_dir.h"
@@ -35,10 +37,12 @@ bool write_file(const char *path, const std::string &text) {
     _exit(SKIPPED);
 }
 
-void enter_namespaces() {
+void enter_namespaces(const SandboxOptions &options) {
     uid_t uid = getuid();
     gid_t gid = getgid();
-    int flags = CLONE_NEWPID | CLONE_NEWNS | CLONE_NEWNET | CLONE_NEWIPC;
+    int flags = CLONE_NEWPID | CLONE_NEWNS | CLONE_NEWIPC;
+    if (options.own_network)
+        flags |= CLONE_NEWNET;
     if (uid != 0)
         flags |= CLONE_NEWUSER;
     if (unshare(flags) != 0)
@@ -56,6 +60,11 @@ void set_up(const SandboxOptions &options) {
         skip("private mounts");
     if (mount("proc", "/proc", "proc", 0, nullptr) != 0)
         skip("mount /proc");
+    // What runs on the machine keeps its state there, and a monitor's report may lie in it.
+    if (mount("run", "/var/run", "tmpfs", 0, "mode=755") != 0)
+        skip("mount /var/run");
+    if (!options.own_network)
+        return;
     sandbox_shell("ip link set lo up");
     if (!options.eth0)
         return;
@@ -90,7 +99,7 @@ void set_up(const SandboxOptions &options) {
 
 [[noreturn]] void run_sandbox(const std::function<void()> &body, const SandboxOptions &options) {
     prctl(PR_SET_PDEATHSIG, SIGKILL);
-    enter_namespaces();
+    enter_namespaces(options);
     pid_t init = fork();
     if (init == 0) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
@@ -103,6 +112,10 @@ void set_up(const SandboxOptions &options) {
     while (waitpid(init, &status, 0) < 0 && errno == EINTR) {
     }
     _exit(WIFEXITED(status) ? WEXITSTATUS(status) : 1);
+}
+
+void mount_on(const std::string &source, const std::string &path) {
+    ASSERT_EQ(0, mount(source.c_str(), path.c_str(), nullptr, MS_BIND, nullptr)) << strerror(errno);
 }
 
 }  // namespace
@@ -148,6 +161,7 @@ void sandbox_scratch(const std::string &path) {
 
 void sandbox_bind(const std::string &source, const std::string &path) {
     namespace fs = std::filesystem;
+    static std::vector<std::pair<std::string, std::string>> bound;
     // A link gives way too: what it points to may be everything, as with busybox.
     if (!fs::exists(path) || fs::is_symlink(path)) {
         fs::path base = fs::path(path).parent_path();
@@ -157,8 +171,15 @@ void sandbox_bind(const std::string &source, const std::string &path) {
         // second layer would hide what is mounted in the first.
         static std::set<fs::path> layered;
         base = fs::canonical(base);
-        if (layered.insert(base).second)
+        if (layered.insert(base).second) {
             sandbox_scratch(base);
+            // The layer hides what was bound below it before.
+            for (const auto &[earlier, target] : bound) {
+                if (fs::canonical(target).string().compare(0, base.string().size() + 1,
+                                                           base.string() + "/") == 0)
+                    mount_on(earlier, target);
+            }
+        }
         fs::create_directories(fs::path(path).parent_path());
         fs::remove(path);
         if (fs::is_directory(source))
@@ -166,5 +187,6 @@ void sandbox_bind(const std::string &source, const std::string &path) {
         else
             fclose(fopen(path.c_str(), "w"));
     }
-    ASSERT_EQ(0, mount(source.c_str(), path.c_str(), nullptr, MS_BIND, nullptr)) << strerror(errno);
+    mount_on(source, path);
+    bound.emplace_back(source, path);
 }

@@ -5,8 +5,9 @@
 #include <string>
 
 struct SandboxOptions {
-    bool eth0 = false;   // a network interface "eth0" (10.99.0.1/24), its other end is "eth1"
-    int timeout_s = 90;  // then everything in it is killed, and the test fails
+    bool eth0 = false;        // a network interface "eth0" (10.99.0.1/24), its other end is "eth1"
+    int timeout_s = 90;       // then everything in it is killed, and the test fails
+    bool own_network = true;  // else the machine's, for tests that it is set aside for
 };
 
 // Runs `body` in a child process inside new pid, mount, network and IPC namespaces (and a user

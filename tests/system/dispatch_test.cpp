@@ -2,10 +2,12 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -201,7 +203,11 @@ TEST(Forkbomb, WithoutArgumentsForksWithoutPauseAndEveryChildSpins) {
             setrlimit(RLIMIT_NPROC, &few);
             (void)!setuid(65534);
         };
-        Background bomb({fieldkit_path(), "forkbomb"}, options);
+        // Where an unprivileged user may have it: the build folder may be somebody's own.
+        TempDir dir;
+        EXPECT_EQ(0, chmod(dir.path().c_str(), 0755));
+        std::filesystem::copy_file(fieldkit_path(), dir / "fieldkit");
+        Background bomb({dir / "fieldkit", "forkbomb"}, options);
         for (int i = 1; i <= 200; ++i)
             EXPECT_EQ("forks " + std::to_string(i), bomb.read_line());
         bomb.send_signal(SIGSTOP);
@@ -224,5 +230,69 @@ TEST(Forkbomb, OfDepthTwoHasChildrenThatForkAndCountOn) {
         EXPECT_EQ(2, std::count(lines.begin(), lines.end(), "forks 2"));
     });
 }
+
+#if !defined(__SANITIZE_ADDRESS__) && !defined(__SANITIZE_THREAD__)
+// With a sanitizer all of them are linked.
+TEST(Libraries, AreNotLoadedBeforeAnAppletNeedsThem) {
+    const RunResult result = run_program(
+        {fieldkit_path(), "ctest"}, {.env = {"LD_TRACE_LOADED_OBJECTS=1"}, .leak_check = false});
+    EXPECT_NE(std::string::npos, result.out.find("libc.so")) << result.out;
+    for (const char *name : {"libsockhand", "libformvars", "libcfgstore", "libz.so", "curl"})
+        EXPECT_EQ(std::string::npos, result.out.find(name)) << result.out;
+}
+
+// The executable alone, in a folder that has none of its libraries beside it.
+std::string copy_executable(const TempDir &dir) {
+    dir.file("sbin/fieldkit", read_whole_file(fieldkit_path()), 0755);
+    EXPECT_EQ(0, symlink("fieldkit", (dir / "sbin/debugar.cgi").c_str()));
+    return dir / "sbin/debugar.cgi";
+}
+
+// Makes the dynamic linker find something else where it looks first.
+RunOptions with_broken_sockhand(const TempDir &dir) {
+    dir.file("broken/libsockhand.so", "no library");
+    RunOptions options;
+    options.env = {"LD_LIBRARY_PATH=" + dir / "broken"};
+    return options;
+}
+
+// That this program itself has loaded.
+std::string path_of_sockhand() {
+    std::ifstream maps("/proc/self/maps");
+    std::string word;
+    while (maps >> word) {
+        if (word.find("/libsockhand.so") != std::string::npos)
+            return word;
+    }
+    ADD_FAILURE() << "no libsockhand.so in this program";
+    return "";
+}
+
+TEST(Libraries, ThatAreBrokenEndTheAppletThatNeedsThem) {
+    run_in_sandbox([] {
+        const TempDir dir;
+        const std::string program = copy_executable(dir);
+        const RunOptions options = with_broken_sockhand(dir);
+        const RunResult service =
+            run_program({program, "-n", "-c", dir / "cgi", "-s", dir / "segf"}, options);
+        EXPECT_EQ(127, service.exit_status);
+        EXPECT_EQ(0u, service.err.find("fieldkit: ")) << service.err;
+        EXPECT_NE(std::string::npos, service.err.find("broken/libsockhand.so")) << service.err;
+        EXPECT_EQ("call exit\n", run_fieldkit({"ctest"}, options).out);
+    });
+}
+
+TEST(Libraries, AreTakenFromBesideTheExecutableWhereTheUsualOnesCannotBeOpened) {
+    run_in_sandbox([] {
+        const TempDir dir;
+        const std::string program = copy_executable(dir);
+        const RunOptions options = with_broken_sockhand(dir);
+        dir.file(LIBRARY_FOLDER "/libsockhand.so", read_whole_file(path_of_sockhand()), 0755);
+        const Background service({program, "-n", "-c", dir / "cgi", "-s", dir / "segf"}, options);
+        EXPECT_TRUE(wait_until([&] { return access((dir / "segf").c_str(), F_OK) == 0; }));
+    });
+}
+
+#endif
 
 }  // namespace

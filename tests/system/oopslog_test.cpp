@@ -113,17 +113,21 @@ void with_each_device(const std::string &image,
         GTEST_SKIP() << "no devices here:" << reasons;
 }
 
+void expect_output_of(const std::string &device, const std::vector<std::string> &options,
+                      const std::string &out, const std::string &err) {
+    std::vector<std::string> words = {"oopslog"};
+    words.insert(words.end(), options.begin(), options.end());
+    words.push_back(device);
+    RunResult result = run_fieldkit(words);
+    EXPECT_EQ(0, result.exit_status);
+    EXPECT_EQ(out, result.out);
+    EXPECT_EQ(err, result.err);
+}
+
 void expect_output(const std::string &image, const std::vector<std::string> &options,
                    const std::string &out, const std::string &err) {
-    with_each_device(image, [&](const std::string &device) {
-        std::vector<std::string> words = {"oopslog"};
-        words.insert(words.end(), options.begin(), options.end());
-        words.push_back(device);
-        RunResult result = run_fieldkit(words);
-        EXPECT_EQ(0, result.exit_status);
-        EXPECT_EQ(out, result.out);
-        EXPECT_EQ(err, result.err);
-    });
+    with_each_device(
+        image, [&](const std::string &device) { expect_output_of(device, options, out, err); });
 }
 
 TEST(OopslogDevices, AreOfEachKind) {
@@ -219,10 +223,7 @@ TEST(OopslogOnEachDevice, PrintsNoTextWhereFlashIsErasedRightBehindTheHeader) {
 }
 
 TEST(OopslogOnEachDevice, ReportsNoLogsOnErasedPages) {
-    for (const char *option : {"", "-r"}) {
-        std::vector<std::string> options;
-        if (*option != '\0')
-            options = {option};
+    for (const std::vector<std::string> &options : {std::vector<std::string>{}, {"-r"}}) {
         expect_output(erased_page() + erased_page(), options, "", "No logs present\n");
         expect_output(std::string(8192, '\0'), options, "", "No logs present\n");
     }
@@ -244,10 +245,7 @@ TEST(OopslogOnEachDevice, FindsOnePageOn6000Bytes) {
 }
 
 TEST(OopslogOnEachDevice, PrintsTheOnlyPageOfADevice) {
-    for (const char *option : {"", "-r"}) {
-        std::vector<std::string> options;
-        if (*option != '\0')
-            options = {option};
+    for (const std::vector<std::string> &options : {std::vector<std::string>{}, {"-r"}}) {
         expect_output(oops_page(1, "one\n"), options, "Log Entry 1 (at position 0)\none\n",
                       "Last log is at position 0 with count 1\n");
     }
@@ -333,10 +331,7 @@ TEST(OopslogOnALoopDevice, ReportsNoLogsWhenItIsEmpty) {
     const auto device = make_loop_device(dir.file("image", ""));
     if (device->path.empty())
         GTEST_SKIP() << device->reason;
-    RunResult result = run_fieldkit({"oopslog", device->path});
-    EXPECT_EQ(0, result.exit_status);
-    EXPECT_EQ("", result.out);
-    EXPECT_EQ("No logs present\n", result.err);
+    expect_output_of(device->path, {}, "", "No logs present\n");
 }
 
 TEST(OopslogOnALoopDevice, PrintsWhatIsLeftWhenItShrinks) {
@@ -351,14 +346,72 @@ TEST(OopslogOnALoopDevice, PrintsWhatIsLeftWhenItShrinks) {
     // The device keeps its size, with nothing behind it any more. Far from the entries that are
     // left: the kernel reads ahead, and may lose all that it reads at once.
     ASSERT_EQ(0, truncate(image.c_str(), 256 * 4096));
-    RunResult result = run_fieldkit({"oopslog", device->path});
-    EXPECT_EQ(0, result.exit_status);
-    EXPECT_EQ(
-        "Log Entry 5 (at position 0)\nfive\n"
-        "Log Entry 6 (at position 1)\nsix\n"
-        "Log Entry 7 (at position 2)\nseven\n",
-        result.out);
-    EXPECT_EQ("Last log is at position 2 with count 7\n", result.err);
+    expect_output_of(device->path, {},
+                     "Log Entry 5 (at position 0)\nfive\n"
+                     "Log Entry 6 (at position 1)\nsix\n"
+                     "Log Entry 7 (at position 2)\nseven\n",
+                     "Last log is at position 2 with count 7\n");
+}
+
+// A log whose pages 256 to 511 are going to be unreadable. The newest report in front of them fills
+// its page, so that what is left of it in a buffer would be seen. Whole stretches of the log, as
+// the kernel reads ahead, and may lose all that it reads at once.
+const std::string LAST_WORDS(4088, 'x');
+std::string failing_image(const std::string &behind) {
+    std::string bytes(768 * 4096, '\xff');
+    bytes.replace(0, 2 * 4096, oops_page(5, "five\n") + oops_page(6, LAST_WORDS));
+    bytes.replace(256 * 4096, 4096, oops_page(9, "unreadable\n"));
+    bytes.replace(511 * 4096, 4096, oops_page(10, "unreadable\n"));
+    if (!behind.empty())
+        bytes.replace(767 * 4096, 4096, behind);
+    return bytes;
+}
+
+TEST(OopslogOnADeviceWithReadErrors, PrintsThePagesAroundThem) {
+    TempDir dir;
+    const std::string image = dir.file("image", failing_image(oops_page(7, "seven\n")));
+    const auto device = make_failing_device(image, 256 * 4096, 512 * 4096);
+    if (device->path.empty())
+        GTEST_SKIP() << device->reason;
+    ASSERT_TRUE(fails_to_read(device->path, 256 * 4096) && fails_to_read(device->path, 511 * 4096));
+    expect_output_of(device->path, {},
+                     "Log Entry 5 (at position 0)\nfive\nLog Entry 6 (at position 1)\n" +
+                         LAST_WORDS + "Log Entry 7 (at position 767)\nseven\n",
+                     "Last log is at position 767 with count 7\n");
+    expect_output_of(
+        device->path, {"-r"},
+        "Log Entry 6 (at position 1)\n" + LAST_WORDS +
+            "Log Entry 5 (at position 0)\nfive\nLog Entry 7 (at position 767)\nseven\n",
+        "Last log is at position 767 with count 7\n");
+}
+
+TEST(OopslogOnADeviceWithReadErrors, ReportsNoLogsWhenNoPageCanBeRead) {
+    TempDir dir;
+    // Only the last page, an erased one, can.
+    const auto device =
+        make_failing_device(dir.file("image", failing_image(erased_page())), 512, 767 * 4096);
+    if (device->path.empty())
+        GTEST_SKIP() << device->reason;
+    ASSERT_TRUE(fails_to_read(device->path, 1 * 4096));
+    for (const std::vector<std::string> &options : {std::vector<std::string>{}, {"-r"}})
+        expect_output_of(device->path, options, "", "No logs present\n");
+}
+
+TEST(OopslogOnADeviceWithReadErrors, EndsWithThemWhenTheBackOfTheDeviceIsLost) {
+    TempDir dir;
+    const std::string image = dir.file("image", failing_image(""));
+    const auto device = make_loop_device(image);
+    if (device->path.empty())
+        GTEST_SKIP() << device->reason;
+    ASSERT_EQ(0, truncate(image.c_str(), 256 * 4096));
+    if (!fails_to_read(device->path, 256 * 4096))
+        GTEST_SKIP() << "a loop device reads zeros behind the end of its file here";
+    for (const std::vector<std::string> &options : {std::vector<std::string>{}, {"-r"}}) {
+        expect_output_of(
+            device->path, options,
+            "Log Entry 5 (at position 0)\nfive\nLog Entry 6 (at position 1)\n" + LAST_WORDS,
+            "Last log is at position 1 with count 6\n");
+    }
 }
 
 TEST(OopslogOnNand, LeavesOutWhatLiesInABadBlock) {
@@ -370,19 +423,16 @@ TEST(OopslogOnNand, LeavesOutWhatLiesInABadBlock) {
         oops_page(8, "bad\n") + oops_page(9, "bad\n") + oops_page(10, "bad\n"));
     if (device->path.empty())
         GTEST_SKIP() << device->reason;
-    RunResult result = run_fieldkit({"oopslog", device->path});
-    EXPECT_EQ(0, result.exit_status);
-    EXPECT_EQ(
-        "Log Entry 1 (at position 8)\ne\nLog Entry 2 (at position 9)\nf\n"
-        "Log Entry 4 (at position 0)\na\nLog Entry 5 (at position 1)\nb\n"
-        "Log Entry 6 (at position 2)\nc\nLog Entry 7 (at position 3)\nd\n",
-        result.out);
-    EXPECT_EQ("Last log is at position 3 with count 7\n", result.err);
-    EXPECT_EQ(
-        "Log Entry 6 (at position 2)\nc\nLog Entry 5 (at position 1)\nb\n"
-        "Log Entry 4 (at position 0)\na\nLog Entry 2 (at position 9)\nf\n"
-        "Log Entry 1 (at position 8)\ne\nLog Entry 7 (at position 3)\nd\n",
-        run_fieldkit({"oopslog", "-r", device->path}).out);
+    expect_output_of(device->path, {},
+                     "Log Entry 1 (at position 8)\ne\nLog Entry 2 (at position 9)\nf\n"
+                     "Log Entry 4 (at position 0)\na\nLog Entry 5 (at position 1)\nb\n"
+                     "Log Entry 6 (at position 2)\nc\nLog Entry 7 (at position 3)\nd\n",
+                     "Last log is at position 3 with count 7\n");
+    expect_output_of(device->path, {"-r"},
+                     "Log Entry 6 (at position 2)\nc\nLog Entry 5 (at position 1)\nb\n"
+                     "Log Entry 4 (at position 0)\na\nLog Entry 2 (at position 9)\nf\n"
+                     "Log Entry 1 (at position 8)\ne\nLog Entry 7 (at position 3)\nd\n",
+                     "Last log is at position 3 with count 7\n");
 }
 
 }  // namespace

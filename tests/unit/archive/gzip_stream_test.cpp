@@ -1,8 +1,15 @@
 #include "archive/gzip_stream.h"
 
+#include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <linux/filter.h>
+#include <linux/seccomp.h>
 #include <signal.h>
+#include <stddef.h>
+#include <stdio.h>
+#include <sys/prctl.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <zlib.h>
@@ -29,6 +36,31 @@ std::string filter(const std::string &input) {
     EXPECT_EQ(pid, waitpid(pid, &status, 0));
     EXPECT_EQ(0, status);
     return read_whole_file(dir / "out");
+}
+
+struct PipedFilter {
+    int in;   // takes the text
+    int out;  // gives the compressed file
+    pid_t pid;
+};
+
+// gzip_filter in a child, which succeeds if that has closed its input in the end.
+PipedFilter start_filter() {
+    int in[2], out[2];
+    EXPECT_EQ(0, pipe(in));
+    EXPECT_EQ(0, pipe(out));
+    pid_t pid = fork();
+    if (pid == 0) {
+        dup2(in[0], 0);
+        dup2(out[1], 1);
+        for (int fd : {in[0], in[1], out[0], out[1]})
+            close(fd);
+        gzip_filter();
+        _exit(fcntl(0, F_GETFD) == -1 ? 0 : 1);
+    }
+    close(in[0]);
+    close(out[1]);
+    return {.in = in[1], .out = out[0], .pid = pid};
 }
 
 std::string varied(size_t size) {
@@ -64,57 +96,115 @@ TEST(GzipFilter, IsReadBackByAnyReaderWithItsCrcAndSize) {
 }
 
 TEST(GzipFilter, StreamsWhileItsInputIsStillOpen) {
-    int in[2], out[2];
-    ASSERT_EQ(0, pipe(in));
-    ASSERT_EQ(0, pipe(out));
-    pid_t pid = fork();
-    if (pid == 0) {
-        dup2(in[0], 0);
-        dup2(out[1], 1);
-        for (int fd : {in[0], in[1], out[0], out[1]})
-            close(fd);
-        gzip_filter();
-        _exit(0);
-    }
-    close(in[0]);
-    close(out[1]);
+    const PipedFilter piped = start_filter();
     std::string text = varied(200000);
     // More than the compressor can hold back, so that reading finds something.
-    EXPECT_EQ(65536, write(in[1], text.data(), 65536));
+    EXPECT_EQ(65536, write(piped.in, text.data(), 65536));
     char byte;
-    EXPECT_EQ(1, read(out[0], &byte, 1));
-    close(in[1]);
-    close(out[0]);
-    waitpid(pid, nullptr, 0);
+    EXPECT_EQ(1, read(piped.out, &byte, 1));
+    close(piped.in);
+    close(piped.out);
+    waitpid(piped.pid, nullptr, 0);
 }
 
 TEST(GzipFilter, EndsAndClosesItsInputWhenTheReaderHasGone) {
-    int in[2], out[2];
-    ASSERT_EQ(0, pipe(in));
-    ASSERT_EQ(0, pipe(out));
     signal(SIGPIPE, SIG_IGN);
-    pid_t pid = fork();
-    if (pid == 0) {
-        dup2(in[0], 0);
-        dup2(out[1], 1);
-        for (int fd : {in[0], in[1], out[0], out[1]})
-            close(fd);
-        gzip_filter();
-        _exit(fcntl(0, F_GETFD) == -1 ? 0 : 1);
-    }
-    close(in[0]);
-    close(out[0]);
-    close(out[1]);
+    const PipedFilter piped = start_filter();
+    close(piped.out);
     std::string text = varied(1000000);
     size_t done = 0;
     ssize_t n;
-    while (done < text.size() && (n = write(in[1], text.data() + done, text.size() - done)) > 0)
+    while (done < text.size() && (n = write(piped.in, text.data() + done, text.size() - done)) > 0)
         done += static_cast<size_t>(n);
     EXPECT_LT(done, text.size()) << "the compressor should have gone away";
     int status;
-    waitpid(pid, &status, 0);
+    waitpid(piped.pid, &status, 0);
     EXPECT_EQ(0, status);
+    close(piped.in);
+}
+
+// In a child: from here on the kernel does not know how to close a range of descriptors.
+void forbid_close_range() {
+#ifdef SYS_close_range
+    sock_filter program[] = {
+        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_close_range, 0, 1),
+        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | ENOSYS),
+        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
+    };
+    const sock_fprog filter = {.len = sizeof(program) / sizeof(program[0]), .filter = program};
+    if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
+        prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter, 0, 0) != 0)
+        perror("seccomp");
+#endif
+}
+
+TEST(GzipChild, KeepsNoDescriptorOfAnotherRequest) {
+    for (bool old_kernel : {false, true}) {
+        int in[2], out[2], other[2];
+        ASSERT_EQ(0, pipe2(in, O_CLOEXEC));
+        ASSERT_EQ(0, pipe2(out, O_CLOEXEC));
+        ASSERT_EQ(0, pipe2(other, O_CLOEXEC));
+        pid_t pid = fork();
+        if (pid == 0) {
+            alarm(20);
+            // As with a service that has many of them.
+            int copies[200];
+            for (int &copy : copies)
+                copy = dup(other[1]);
+            if (old_kernel)
+                forbid_close_range();
+            run_gzip_child(in[0], out[1]);
+        }
+        close(in[0]);
+        close(out[1]);
+        close(other[1]);
+        // The other request's connection ends while the compressor goes on.
+        char byte;
+        EXPECT_EQ(0, read(other[0], &byte, 1));
+        ASSERT_EQ(4, write(in[1], "text", 4));
+        close(in[1]);
+        std::string file(1000, '\0');
+        size_t length = 0;
+        for (ssize_t n; (n = read(out[0], &file[length], file.size() - length)) > 0;)
+            length += static_cast<size_t>(n);
+        file.resize(length);
+        EXPECT_EQ("text", gunzip(file));
+        close(out[0]);
+        close(other[0]);
+        int status;
+        EXPECT_EQ(pid, waitpid(pid, &status, 0));
+        EXPECT_EQ(0, status);
+    }
+}
+
+TEST(GzipChild, LeavesTextThatItsParentHasNotFlushedToItsParent) {
+#ifdef __SANITIZE_THREAD__
+    GTEST_SKIP() << "the thread sanitizer flushes all streams at any kind of exit";
+#endif
+    int in[2], out[2];
+    ASSERT_EQ(0, pipe2(in, O_CLOEXEC));
+    ASSERT_EQ(0, pipe2(out, O_CLOEXEC));
+    pid_t pid = fork();
+    if (pid == 0) {
+        alarm(20);
+        setvbuf(stdout, nullptr, _IOFBF, BUFSIZ);
+        fputs("a tracer's complaint", stdout);
+        run_gzip_child(in[0], out[1]);
+    }
+    close(in[0]);
+    close(out[1]);
+    ASSERT_EQ(4, write(in[1], "text", 4));
     close(in[1]);
+    char file[1000];
+    size_t length = 0;
+    for (ssize_t n; (n = read(out[0], file + length, sizeof file - length)) > 0;)
+        length += static_cast<size_t>(n);
+    close(out[0]);
+    EXPECT_EQ(filter("text"), std::string(file, length));
+    int status;
+    EXPECT_EQ(pid, waitpid(pid, &status, 0));
+    EXPECT_EQ(0, status);
 }
 
 }  // namespace

@@ -170,6 +170,13 @@ TEST(AddCommandOutput, HoldsOutputAndErrorsWhateverTheExitCode) {
     EXPECT_EQ("out\nerr\n", members[0].data);
 }
 
+TEST(AddCommandOutput, IsNoOtherDescriptorOfTheCommandThanItsStandardOnes) {
+    ArchiveFile archive;
+    char name[] = "/tmp/.testXXXXXX";
+    EXPECT_EQ(0, add_shell_output(archive, "ls -l /proc/$$/fd | grep -c '/tmp/.test'", name));
+    EXPECT_EQ("2\n", archive.close().at(0).data);
+}
+
 TEST(AddCommandOutput, OfAProgramThatDoesNotExistHoldsTheReason) {
     ArchiveFile archive;
     char name[] = "/tmp/.testXXXXXX";

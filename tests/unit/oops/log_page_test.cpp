@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <string.h>
 
+#include <random>
 #include <string>
 
 #include "support/oops_image.h"
@@ -95,6 +96,30 @@ TEST(LogText, ShowsEachByteByItselfOrAsADot) {
                   "abcdefghijklmnopqrstuvwxyz{|}~" +
                   std::string(128, '.'),
               text_of(page_of(oops_page(1, all))));
+}
+
+// A byte at a time, up to the first one of erased flash.
+std::string plain_text_of(const std::string &page) {
+    std::string text;
+    for (size_t i = 8; i < page.size() && page[i] != '\xff'; ++i) {
+        const bool shown =
+            (page[i] >= ' ' && page[i] <= '~') || (page[i] >= '\t' && page[i] <= '\r');
+        text += shown ? page[i] : '.';
+    }
+    return text;
+}
+
+TEST(LogText, OfAnyPageIsWhatIsFoundAByteAtATime) {
+    std::minstd_rand random(1);
+    for (int round = 0; round < 2000; ++round) {
+        // Down to pages without an erased byte, which are rare where each byte may be one.
+        const unsigned highest = round % 2 == 0 ? 0xff : 0xfe;
+        std::string page = oops_page(1, "");
+        const size_t length = round % 3 == 0 ? random() % page.size() : page.size();
+        for (size_t i = 8; i < length; ++i)
+            page[i] = static_cast<char>(random() % (highest + 1));
+        ASSERT_EQ(plain_text_of(page), text_of(page_of(page))) << round;
+    }
 }
 
 TEST(NewerCount, IsTheGreaterOneAsUnsignedNumbers) {

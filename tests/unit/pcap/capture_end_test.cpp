@@ -3,17 +3,13 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <linux/filter.h>
-#include <linux/seccomp.h>
 #include <pthread.h>
 #include <signal.h>
-#include <stddef.h>
-#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/syscall.h>
 
 #include <atomic>
 #include <functional>
-#include <optional>
 #include <string>
 
 #include "capture_run.h"
@@ -24,24 +20,6 @@
 #include "support/temp_dir.h"
 
 namespace {
-
-// Makes a system call, or only those with `third` as third argument, fail with `error` from now on.
-// Says whether the machine can do that.
-bool refuse_call(unsigned number, unsigned error, std::optional<unsigned> third = std::nullopt) {
-    sock_filter code[] = {
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 3),
-        // The low half of the argument on these little-endian machines.
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, args[2])),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, third.value_or(0), 0,
-                 static_cast<uint8_t>(third ? 1 : 0)),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-    };
-    sock_fprog program = {.len = 6, .filter = code};
-    return prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
-           prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
-}
 
 // Collects what is printed on standard error.
 struct StderrCapture {
@@ -83,6 +61,29 @@ void expect_promiscuous_off_after(const CaptureOptions &options,
                 EXPECT_FALSE(is_link_promiscuous("eth0")) << "before: " << before;
                 set_link_up("eth0", true);
             }
+        },
+        WITH_ETH0);
+}
+
+// Lets a client go in the way `go` and expects that a capture with a time limit then waits for
+// frames. It runs in the process's first thread, whose state is the one that the process shows.
+void expect_sleep_without_client(const std::function<void(Output &)> &go) {
+    run_in_sandbox(
+        [&] {
+            signal(SIGPIPE, SIG_IGN);
+            Output out;
+            std::thread client([&] {
+                char header[24];
+                EXPECT_EQ(24, recv(out.reader, header, sizeof header, MSG_WAITALL));
+                go(out);
+                // One that finds its output readable again and again is always about to run.
+                EXPECT_TRUE(wait_until([] {
+                    return read_whole_file("/proc/self/stat").find(") S ") != std::string::npos;
+                }));
+                set_link_up("eth0", false);
+            });
+            EXPECT_EQ(24, capture_into(out.fd, {.time_limit = 1000}));
+            client.join();
         },
         WITH_ETH0);
 }
@@ -219,6 +220,38 @@ TEST(CaptureEnd, WithATimeLimitTheEndOfTheClientsSendingDoesNotEndIt) {
         WITH_ETH0);
 }
 
+TEST(CaptureEnd, WithALimitItSleepsAfterTheEndOfTheClientsSending) {
+    expect_sleep_without_client([](Output &out) { ASSERT_EQ(0, shutdown(out.reader, SHUT_WR)); });
+}
+
+TEST(CaptureEnd, WithALimitItSleepsAfterTheClientsClosing) {
+    expect_sleep_without_client([](Output &out) { ASSERT_EQ(0, close(out.reader)); });
+}
+
+TEST(CaptureEnd, WithALimitItSleepsAfterTheClientsReset) {
+    expect_sleep_without_client([](Output &out) {
+        // Closed with something unread, a local socket resets the other end.
+        ASSERT_EQ(1, write(out.fd, "x", 1));
+        ASSERT_EQ(0, close(out.reader));
+    });
+}
+
+TEST(CaptureEnd, TheTimeLimitEndsItThoughFramesKeepComing) {
+    run_in_sandbox(
+        [] {
+            CaptureRun run({.time_limit = 1});
+            std::atomic<bool> ended = false;
+            std::thread sender([&] {
+                while (!ended)
+                    send_frame("eth1", test_frame(60, 'x'));
+            });
+            EXPECT_LT(100u, run.read_all().size());
+            ended = true;
+            sender.join();
+        },
+        WITH_ETH0);
+}
+
 TEST(CaptureEnd, TheLargestTimeLimitsDoNotOverflow) {
     run_in_sandbox(
         [] {
@@ -324,7 +357,7 @@ TEST(CaptureFailure, ThePacketSocketIsMadeWithThePlainProtocolNumber3) {
     run_in_sandbox(
         [] {
 #ifdef __NR_socket
-            if (!refuse_call(__NR_socket, EPROTO, 3))
+            if (!refuse_call(__NR_socket, EPROTO, CallArgument{2, 3}))
                 GTEST_SKIP() << "seccomp: " << strerror(errno);
             Output out;
             EXPECT_EQ(-EPROTO, capture_into(out.fd, {.time_limit = 1}));

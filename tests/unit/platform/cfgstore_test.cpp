@@ -1,6 +1,9 @@
 #include <cfgstore.h>
+#include <errno.h>
 #include <gtest/gtest.h>
+#include <string.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <string>
 #include <vector>
@@ -106,6 +109,14 @@ TEST(ConfigStore, AFileOfMoreThanAMebibyteIsRefused) {
     cfgstore_closecfg(cfg);
     EXPECT_EQ(cfgstore_opencfg(dir.file("over", line + std::string(1048573, '\n')).c_str()),
               nullptr);
+}
+
+TEST(ConfigStore, AFileOfMoreThanASizeOf32BitsIsRefused) {
+    TempDir dir;
+    const std::string path = dir.file("huge", "a=1\n");
+    if (truncate(path.c_str(), (off_t{1} << 32) + 4) != 0)
+        GTEST_SKIP() << "truncate: " << strerror(errno);
+    EXPECT_EQ(cfgstore_opencfg(path.c_str()), nullptr);
 }
 
 TEST(ConfigStore, ClosingNothingIsHarmless) {

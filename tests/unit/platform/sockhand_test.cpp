@@ -1,4 +1,3 @@
-#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -16,18 +15,10 @@
 #include <string>
 #include <vector>
 
+#include "support/process_state.h"
 #include "support/temp_dir.h"
 
 namespace {
-
-int count_descriptors() {
-    DIR *dir = opendir("/proc/self/fd");
-    int count = 0;
-    while (readdir(dir) != nullptr)
-        ++count;
-    closedir(dir);
-    return count;
-}
 
 // The file that a descriptor stands for, whatever its number.
 std::pair<dev_t, ino_t> identity(int fd) {
@@ -45,7 +36,7 @@ struct Received {
 class SockHand : public testing::Test {
   protected:
     void SetUp() override {
-        descriptors_before_ = count_descriptors();
+        descriptors_before_ = count_descriptors(getpid());
         server_ = sockhand_server_socket(path().c_str(), 0666);
         ASSERT_GE(server_, 0) << strerror(errno);
         ASSERT_EQ(pipe2(pipe_, O_CLOEXEC), 0);
@@ -55,7 +46,8 @@ class SockHand : public testing::Test {
         close(pipe_[0]);
         close(pipe_[1]);
         sockhand_close(server_);
-        EXPECT_EQ(count_descriptors(), descriptors_before_) << "a descriptor was left behind";
+        EXPECT_EQ(count_descriptors(getpid()), descriptors_before_)
+            << "a descriptor was left behind";
     }
 
     std::string path() const { return dir_ / "socket"; }
@@ -192,17 +184,17 @@ TEST_F(SockHand, SilentSendersNeitherStopNorSlowTheOthers) {
 }
 
 TEST_F(SockHand, SilentSendersHoldABoundedNumberOfDescriptors) {
-    const int before = count_descriptors();
+    const int before = count_descriptors(getpid());
     std::vector<int> silent;
     for (int i = 0; i < 100; ++i) {
         silent.push_back(connect_raw());
         (void)receive_next();
     }
-    EXPECT_LE(count_descriptors() - before, 100 + 32);
+    EXPECT_LE(count_descriptors(getpid()) - before, 100 + 32);
     for (const int fd : silent)
         close(fd);
     (void)receive_next();
-    EXPECT_EQ(count_descriptors(), before) << "connections that ended are let go";
+    EXPECT_EQ(count_descriptors(getpid()), before) << "connections that ended are let go";
 }
 
 TEST_F(SockHand, OfSilentSendersTheOneThatCameFirstIsLetGoFirst) {
@@ -245,12 +237,12 @@ TEST_F(SockHand, TheFirstOfSeveralDescriptorsIsTakenAndTheOthersAreClosed) {
         const int sender = connect_raw();
         send_raw(sender, "several", fds);
         close(sender);
-        const int before = count_descriptors();
+        const int before = count_descriptors(getpid());
         const Received received = receive_next();
         EXPECT_EQ(received.text, "several");
         ASSERT_GE(received.fd, 0);
         EXPECT_EQ(identity(received.fd), identity(pipe_[1]));
-        EXPECT_EQ(count_descriptors(), before + 1) << extra;
+        EXPECT_EQ(count_descriptors(getpid()), before + 1) << extra;
         close(received.fd);
     }
     close(other[0]);
@@ -323,7 +315,7 @@ TEST_F(SockHand, ATakenOrImpossiblePathGivesNoServer) {
 
 TEST_F(SockHand, AServerThatWasOnlyClosedIsReleasedWhenItsNumberComesBack) {
     const std::string other = dir_ / "other";
-    const int before = count_descriptors();
+    const int before = count_descriptors(getpid());
     int server = -1;
     for (int i = 0; i < 10; ++i) {
         server = sockhand_server_socket(other.c_str(), 0600);
@@ -332,7 +324,7 @@ TEST_F(SockHand, AServerThatWasOnlyClosedIsReleasedWhenItsNumberComesBack) {
             close(server);
         unlink(other.c_str());
     }
-    EXPECT_LT(count_descriptors() - before, 12);
+    EXPECT_LT(count_descriptors(getpid()) - before, 12);
     sockhand_close(server);
 }
 

@@ -3,15 +3,19 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <fstream>
 #include <string>
 #include <vector>
 
+#include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/temp_dir.h"
 #include "util/unique_fd.h"
@@ -117,6 +121,63 @@ TEST(DescribeFd, LeavesTheBufferAloneWhenThereIsNoSuchDescriptor) {
     EXPECT_EQ("-1 (untouched)", describe(987));
 }
 
+TEST(DescribeFd, FollowsADescriptorThatBecomesAnother) {
+    UniqueFd fd(open("/dev/null", O_RDONLY));
+    for (int i = 0; i < 3; ++i)
+        EXPECT_EQ("/dev/null", describe(fd.get()));
+    UniqueFd other(open("/dev/zero", O_RDONLY));
+    ASSERT_EQ(fd.get(), dup2(other.get(), fd.get()));
+    EXPECT_EQ("/dev/zero", describe(fd.get()));
+    int number = fd.get();
+    fd.reset();
+    EXPECT_EQ("-1 (untouched)", describe(number));
+    forget_last_process();
+}
+
+TEST(DescribeFd, KeepsOneDescriptorForOneProcessAndNoneInTheEnd) {
+    int fds[1024];
+    int before = list_fds(getpid(), fds, 1024);
+    (void)describe(0);
+    EXPECT_EQ(before, list_fds(getpid(), fds, 1024)) << "also for one that is asked for once";
+    (void)describe(0);
+    (void)describe(1);
+    EXPECT_EQ(before + 1, list_fds(getpid(), fds, 1024));
+    forget_last_process();
+    EXPECT_EQ(before, list_fds(getpid(), fds, 1024));
+}
+
+// In the sandbox a process can get the number of another one that has just gone.
+TEST(DescribeFd, TellsAProcessFromAnotherThatHasTakenItsNumber) {
+    run_in_sandbox([] {
+        auto start = [](const char *path) {
+            pid_t pid = fork();
+            if (pid == 0) {
+                int fd = open(path, O_RDONLY);
+                dup2(fd, 100);
+                pause();
+            }
+            return pid;
+        };
+        auto shown = [](pid_t pid) {
+            char buf[512] = "";
+            return describe_fd(pid, 100, buf, sizeof buf) > 0 ? std::string(buf) : "";
+        };
+        pid_t first = start("/dev/null");
+        EXPECT_TRUE(wait_until([&] { return shown(first) == "/dev/null"; }));
+        EXPECT_EQ("/dev/null", shown(first));
+        kill(first, SIGKILL);
+        waitpid(first, nullptr, 0);
+        EXPECT_EQ("", shown(first));
+        std::ofstream("/proc/sys/kernel/ns_last_pid") << first - 1;
+        pid_t second = start("/dev/zero");
+        if (second != first)
+            GTEST_SKIP() << "this kernel gives no chosen process number";
+        EXPECT_TRUE(wait_until([&] { return shown(second) == "/dev/zero"; }));
+        kill(second, SIGKILL);
+        waitpid(second, nullptr, 0);
+    });
+}
+
 TEST(DescribeFd, ShowsAListeningSocketWithTheRemoteSideZero) {
     int port;
     UniqueFd fd = listen_on_loopback(AF_INET, &port);
@@ -136,6 +197,7 @@ TEST(DescribeFd, ShowsAConnectionsEndsAndState) {
 
 TEST(DescribeFd, ShowsAnIpv6Connection) {
     run_in_sandbox([] {
+        forget_last_process();
         int port;
         UniqueFd listener = listen_on_loopback(AF_INET6, &port);
         UniqueFd client = connect_to(listener.get());
@@ -190,6 +252,12 @@ struct Tables {
     std::string find(unsigned long inode) const {
         char buf[300] = "(nothing)";
         int length = describe_socket_inode_in(dir.path().c_str(), inode, buf, sizeof buf);
+        // What a snapshot holds is the same.
+        char from_snapshot[300] = "(nothing)";
+        SocketSnapshot snapshot(dir.path().c_str());
+        for (int i = 0; i < 2; ++i)
+            EXPECT_EQ(length, snapshot.describe(inode, from_snapshot, sizeof from_snapshot));
+        EXPECT_STREQ(buf, from_snapshot);
         return std::to_string(length) + " " + buf;
     }
 };
@@ -237,6 +305,64 @@ TEST(DescribeSocketInode, SurvivesTablesOfNoise) {
             tables.dir.file(name, noise);
         (void)tables.find(static_cast<unsigned long>(round));
     }
+}
+
+TEST(SocketSnapshot, HoldsTablesOfThousandsOfLines) {
+    Tables tables;
+    std::string tcp, tcp6, unix_table;
+    for (int i = 2000; i > 0; --i) {
+        char line[256];
+        (void)snprintf(
+            line, sizeof line,
+            "%4d: 0200000A:%04X 0900000A:C886 01 00000000:00000000 00:00000000 00000000  "
+            "1000        0 %d 1 0000000000000000 20 4 30 10 -1\n",
+            i, i, i * 7);
+        tcp += line;
+        (void)snprintf(line, sizeof line,
+                       "00000000: 00000002 00000000 00010000 0001 01 %d /run/%d\n", i * 5, i);
+        unix_table += line;
+    }
+    tables.dir.file("tcp", tcp);
+    tables.dir.file("unix", unix_table);
+    SocketSnapshot snapshot(tables.dir.path().c_str());
+    for (unsigned long inode = 0; inode < 15000; inode += 5) {
+        char expected[128] = "", actual[128] = "";
+        if (inode % 500 == 0 || inode % 35 == 0)
+            (void)describe_socket_inode_in(tables.dir.path().c_str(), inode, expected, 128);
+        else
+            continue;
+        (void)snapshot.describe(inode, actual, 128);
+        EXPECT_STREQ(expected, actual);
+    }
+}
+
+TEST(SocketSnapshot, LeavesTablesThatAreTooLargeToASearch) {
+    Tables tables;
+    std::string line = "00000000: 00000002 00000000 00010000 0001 01 4711 /run/a\n";
+    std::string text;
+    while (text.size() < 4 * 1024 * 1024)
+        text += line;
+    tables.dir.file("unix", text);
+    SocketSnapshot snapshot(tables.dir.path().c_str());
+    char buf[100];
+    EXPECT_EQ(NO_MATCH, snapshot.describe(4711, buf, sizeof buf));
+    EXPECT_EQ(NO_MATCH, snapshot.describe(4711, buf, sizeof buf));
+}
+
+TEST(SocketSnapshot, ShowsWhatTheKernelShows) {
+    run_in_sandbox([] {
+        forget_last_process();
+        int port;
+        UniqueFd listener = listen_on_loopback(AF_INET, &port);
+        UniqueFd client = connect_to(listener.get());
+        SocketSnapshot snapshot;
+        for (int fd : {listener.get(), client.get()}) {
+            char buf[512];
+            int length = describe_fd(getpid(), fd, buf, sizeof buf, &snapshot);
+            EXPECT_EQ(describe(fd), buf);
+            EXPECT_EQ(static_cast<int>(strlen(buf)), length);
+        }
+    });
 }
 
 }  // namespace

@@ -4,14 +4,19 @@
 #include <gtest/gtest.h>
 #include <linux/capability.h>
 #include <signal.h>
+#include <sys/mman.h>
 #include <sys/prctl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 
 #include <algorithm>
+#include <array>
 #include <atomic>
 #include <functional>
+#include <memory>
 #include <string>
 #include <thread>
 #include <vector>
@@ -19,6 +24,7 @@
 #include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/temp_dir.h"
+#include "util/unique_fd.h"
 
 namespace {
 
@@ -35,8 +41,8 @@ class Child {
             close(ready[0]);
             ready_fd = ready[1];
             set_up();
-            (void)!write(ready[1], "x", 1);
-            close(ready[1]);
+            (void)!write(ready_fd, "x", 1);
+            close(ready_fd);
             for (;;)
                 pause();
         }
@@ -170,6 +176,87 @@ TEST(ProcName, FitsEveryBufferOfTwoBytesOrMore) {
         EXPECT_LT(name.size(), std::max<size_t>(size, 7)) << name;
     }
     EXPECT_EQ("lo", proc.name(10, 8));
+}
+
+// The plain way to the two: each file is looked for, opened and read for one of them alone.
+struct NameAndParent {
+    int named;
+    std::string name;
+    pid_t parent;
+    bool operator==(const NameAndParent &) const = default;
+};
+
+NameAndParent plain_name_and_parent(const std::string &root, pid_t pid, size_t size) {
+    std::string directory = root + "/" + std::to_string(pid) + "/";
+    std::string buf(size, '#');
+    auto read_text = [&](const char *file) {
+        struct stat status;
+        if (stat((directory + file).c_str(), &status) != 0)
+            return false;
+        ssize_t n = read_file((directory + file).c_str(), buf.data(), size);
+        if (n < 1)
+            return false;
+        buf[std::min(static_cast<size_t>(n), size - 1)] = '\0';
+        return true;
+    };
+    if (!(read_text("cmdline") && name_from_cmdline(buf.data())) &&
+        !(read_text("stat") && name_from_stat(buf.data())))
+        return {0, "", -1};
+    char text[257];
+    ssize_t n = read_file((directory + "stat").c_str(), text, 256);
+    text[n > 0 ? n : 0] = '\0';
+    return {1, buf.c_str(), n > 0 ? ppid_from_stat(text) : -1};
+}
+
+NameAndParent name_and_parent(const std::string &root, pid_t pid, size_t size) {
+    std::string buf(size, '#');
+    pid_t parent = 4711;
+    int named = proc_name_and_parent(root.c_str(), pid, buf.data(), size, &parent);
+    return {named, named ? buf.c_str() : "", parent};
+}
+
+TEST(ProcNameAndParent, AreThoseOfThePlainReadersForEveryFileAndBuffer) {
+    FakeProc proc;
+    const std::string long_arguments = "/usr/bin/" + std::string(300, 'n');
+    const std::string long_name = "(" + std::string(300, 'n') + ") S 9 1";
+    const std::string cmdlines[] = {
+        "",         "/usr/bin/app" + NUL + "-v", "app" + NUL, "app/", NUL + "/x", long_arguments,
+        "\xff/\xfe"};
+    const std::string stats[] = {"",
+                                 "10 (stat name) S 7 8",
+                                 "10 (app) S 7",
+                                 "10 (a) (b) S 7 8",
+                                 "10 (app)",
+                                 "10 () S 7",
+                                 "(" + NUL + ") S 7",
+                                 long_name,
+                                 "10 (app) " + std::string(244, ' ') + "S 71234 5",
+                                 std::string(300, ' '),
+                                 "1 2 3 99999999999999999999"};
+    pid_t pid = 10;
+    for (const std::string &cmdline : cmdlines) {
+        for (const std::string &stat : stats)
+            proc.process(pid++, cmdline, stat);
+    }
+    proc.dir.file(std::to_string(pid++) + "/cmdline", "/usr/bin/app");  // without a stat file
+    proc.dir.file(std::to_string(pid++) + "/stat", "10 (app) S 7 8");
+    proc.dir.file(std::to_string(pid) + "/stat/x", "a directory in the file's place");
+    proc.dir.file(std::to_string(pid++) + "/cmdline/x", "");
+    for (; pid >= 9; --pid) {
+        for (size_t size : {2, 3, 4, 8, 9, 13, 14, 20, 128, 255, 256})
+            ASSERT_EQ(plain_name_and_parent(proc.dir.path(), pid, size),
+                      name_and_parent(proc.dir.path(), pid, size))
+                << pid << " " << size;
+    }
+    EXPECT_EQ((NameAndParent{1, "stat name", 0}), name_and_parent(proc.dir.path(), 11, 128));
+    EXPECT_EQ((NameAndParent{1, "app", 7}), name_and_parent(proc.dir.path(), 12, 128));
+    EXPECT_EQ((NameAndParent{0, "", -1}), name_and_parent(proc.dir.path(), 0x7fffffff, 128));
+}
+
+TEST(ProcNameAndParent, TellsOfRealProcesses) {
+    Child child([] { prctl(PR_SET_NAME, "a b"); });
+    EXPECT_EQ((NameAndParent{1, "unit_proc", getppid()}), name_and_parent("/proc", getpid(), 128));
+    EXPECT_EQ((NameAndParent{1, "unit_proc", 0}), name_and_parent("/proc", child.pid(), 128));
 }
 
 TEST(PidName, TellsOurOwnName) {
@@ -320,6 +407,138 @@ TEST(CountFds, OfThreeSocketsAndTwoPipesGivesThreeSocketsAndNoPipes) {
     EXPECT_EQ(3, sockets);
     EXPECT_EQ(0, pipes);
     EXPECT_EQ(5, count_fds(child.pid(), nullptr, nullptr));
+}
+
+// What count_fds gives, and the plain way to it: a directory stream and a link at a time.
+using Counts = std::array<int, 3>;
+
+Counts counted(pid_t pid) {
+    int sockets = -1, pipes = -1;
+    int all = count_fds(pid, &sockets, &pipes);
+    return {all, sockets, pipes};
+}
+
+Counts plainly_counted(pid_t pid) {
+    Counts counts = {};
+    UniqueDir dir(opendir(("/proc/" + std::to_string(pid) + "/fd").c_str()));
+    while (const dirent *entry = dir != nullptr ? readdir(dir.get()) : nullptr) {
+        if (entry->d_name[0] == '.')
+            continue;
+        ++counts[0];
+        char target[128];
+        ssize_t n = readlinkat(dirfd(dir.get()), entry->d_name, target, sizeof target - 1);
+        target[std::max<ssize_t>(n, 0)] = '\0';
+        if (strncmp(target, "socket:[", 8) == 0)
+            ++counts[1];
+        else if (strcmp(target, "pipe:[") == 0)
+            ++counts[2];
+    }
+    return counts;
+}
+
+TEST(CountFds, GivesWhatADirectoryStreamShowsForTablesOfAnyKindAndSize) {
+    TempDir dir;
+    const std::string decoy = dir.file("socket:[1]", "");
+    const std::string long_path = dir.file(std::string(200, 'l'), "");
+    for (int count : {0, 1, 5, 40, 350, 900}) {
+        Child child([&] {
+            rlimit limit = {2048, 2048};
+            (void)setrlimit(RLIMIT_NOFILE, &limit);
+            for (int fd = 0; fd < 2048; ++fd) {
+                if (fd != ready_fd)
+                    close(fd);
+            }
+            for (int i = 0; i < count; ++i) {
+                switch (i % 4) {
+                    case 0:
+                        (void)socket(AF_UNIX, SOCK_STREAM, 0);
+                        break;
+                    case 1:
+                        (void)open(decoy.c_str(), O_RDONLY);
+                        break;
+                    case 2:
+                        (void)open(long_path.c_str(), O_RDONLY);
+                        break;
+                    case 3:
+                        (void)memfd_create("socket:[2]", 0);
+                        break;
+                }
+            }
+            // One far away from the others, and a gap.
+            (void)dup2(0, 1500);
+            if (count > 20)
+                close(1);
+        });
+        const int all = count == 0 ? 0 : count > 20 ? count : count + 1;
+        const int sockets = count == 0 ? 0 : (count + 3) / 4 + 1;
+        // What tells us of its being ready is closed a moment later.
+        ASSERT_TRUE(wait_until([&] { return plainly_counted(child.pid())[0] == all; })) << count;
+        EXPECT_EQ((Counts{all, sockets, 0}), counted(child.pid()));
+        EXPECT_EQ(plainly_counted(child.pid()), counted(child.pid()));
+    }
+}
+
+// Leaves a process with exactly those of the descriptors 0 to 255 that `wanted` wants, each third
+// of them a socket.
+void keep_descriptors(const std::function<bool(int)> &wanted) {
+    ready_fd = fcntl(ready_fd, F_DUPFD, 500);
+    for (int fd = 0; fd < 500; ++fd)
+        close(fd);
+    int socket_fd = fcntl(socket(AF_UNIX, SOCK_STREAM, 0), F_DUPFD, 300);
+    int file_fd = fcntl(open("/dev/null", O_RDONLY), F_DUPFD, 300);
+    close(0);
+    close(1);
+    for (int fd = 0; fd < 256; ++fd) {
+        if (wanted(fd))
+            (void)dup2(fd % 3 == 0 ? socket_fd : file_fd, fd);
+    }
+    close(socket_fd);
+    close(file_fd);
+}
+
+TEST(CountFds, OfNumbersWithGapsAnywhereIsThatOfTheDescriptorsInUse) {
+    struct {
+        const char *numbers;
+        bool (*wanted)(int fd);
+        Counts counts;
+    } const cases[] = {
+        {"all", [](int) { return true; }, {256, 86, 0}},
+        {"all but the first", [](int fd) { return fd > 0; }, {255, 85, 0}},
+        {"all but the first forty", [](int fd) { return fd >= 40; }, {216, 72, 0}},
+        {"all but the first hundred", [](int fd) { return fd >= 100; }, {156, 52, 0}},
+        {"the even ones", [](int fd) { return fd % 2 == 0; }, {128, 43, 0}},
+        {"all but each sixth", [](int fd) { return fd % 6 != 5; }, {214, 86, 0}},
+        {"a shell's", [](int fd) { return fd < 3 || fd == 255; }, {4, 2, 0}},
+        {"the first", [](int fd) { return fd == 0; }, {1, 1, 0}},
+        {"the last", [](int fd) { return fd == 255; }, {1, 1, 0}},
+        {"none", [](int) { return false; }, {0, 0, 0}},
+    };
+    for (const auto &[numbers, wanted, counts] : cases) {
+        Child child([&] { keep_descriptors(wanted); });
+        // What tells us of its being ready is closed a moment later.
+        ASSERT_TRUE(wait_until([&] { return plainly_counted(child.pid()) == counts; })) << numbers;
+        EXPECT_EQ(counts, counted(child.pid())) << numbers;
+    }
+}
+
+TEST(CountFds, EndsForProcessesThatEndMeanwhile) {
+    for (int i = 0; i < 50; ++i) {
+        auto child = std::make_unique<Child>([] {
+            for (int fd = 0; fd < 200; ++fd)
+                (void)dup(0);
+        });
+        pid_t pid = child->pid();
+        std::thread end([&] { child.reset(); });
+        int sockets = -1, pipes = -1;
+        int all = 0;
+        do {
+            all = count_fds(pid, &sockets, &pipes);
+            EXPECT_GE(all, sockets);
+        } while (all != 0);
+        EXPECT_EQ(0, sockets);
+        EXPECT_EQ(0, pipes);
+        end.join();
+    }
 }
 
 TEST(CountFds, OfAProcessThatHasGoneIsZeroThroughout) {

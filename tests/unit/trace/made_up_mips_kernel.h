@@ -77,10 +77,13 @@ class MadeUpMipsKernel {
         if (request == PTRACE_GETREGS) {
             if (getregs_fails)
                 return fail();
-            // Telling values, to see which of them are replaced by peeks.
             auto *slots = reinterpret_cast<uint64_t *>(data);
             for (uint64_t i = 0; i < 38; i++)
                 slots[i] = 0x1111000000000000 + i;
+            // Sign-extended, with the program counter behind the general registers, lo and hi.
+            for (const auto &[number, value] : user)
+                slots[number == 64 ? 34 : number] =
+                    static_cast<uint64_t>(static_cast<int64_t>(static_cast<int32_t>(value)));
             return 0;
         }
         if (request == PTRACE_PEEKUSER) {

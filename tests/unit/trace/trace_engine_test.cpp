@@ -1,6 +1,5 @@
 #include "trace/trace_engine.h"
 
-#include <dirent.h>
 #include <errno.h>
 #include <gtest/gtest.h>
 #include <pthread.h>
@@ -11,6 +10,7 @@
 #include <atomic>
 #include <thread>
 
+#include "support/process_state.h"
 #include "support/sandbox.h"
 #include "unit/trace/tracees.h"
 
@@ -20,15 +20,6 @@ double seconds() {
     timespec now;
     clock_gettime(CLOCK_MONOTONIC, &now);
     return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) * 1e-9;
-}
-
-int open_descriptors() {
-    DIR *dir = opendir("/proc/self/fd");
-    int count = 0;
-    while (readdir(dir) != nullptr)
-        ++count;
-    closedir(dir);
-    return count;
 }
 
 bool has_children() {
@@ -181,11 +172,8 @@ TEST_F(TraceRun, EndsWithTheExitOfItsLastProcess) {
     Child first([] { _exit(1); }, Child::HELD);
     Child second([] { _exit(2); }, Child::HELD);
     TraceLog log;
-    std::vector<pid_t> pids = {first.pid(), -1, second.pid()};
-    TraceRequest request = request_for(&log, &pids, TRACE_EXIT_EVENT);
-    request.attached = 1;
-    request.timeout_s = 1000;
-    trace_run(&request);
+    std::vector<pid_t> pids =
+        trace_held(&log, {first.pid(), -1, second.pid()}, TRACE_EXIT_EVENT, 1000);
     EXPECT_EQ(pids, (std::vector<pid_t>{-1, -1, -1}));
     EXPECT_FALSE(has_children());
 }
@@ -193,10 +181,7 @@ TEST_F(TraceRun, EndsWithTheExitOfItsLastProcess) {
 TEST_F(TraceRun, EndsAfterADeathBySignalWhenThereIsNothingMoreToWaitFor) {
     Child child([] { raise(SIGKILL); }, Child::HELD);
     TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request = request_for(&log, &pids);
-    request.attached = 1;
-    trace_run(&request);
+    std::vector<pid_t> pids = trace_held(&log, {child.pid()});
     EXPECT_EQ(pids[0], -1);
     EXPECT_FALSE(has_children());
 }
@@ -204,12 +189,8 @@ TEST_F(TraceRun, EndsAfterADeathBySignalWhenThereIsNothingMoreToWaitFor) {
 TEST_F(TraceRun, LeavesTheEndToTheTimerWhenItsLastProcessDiesOfASignal) {
     Child child([] { raise(SIGKILL); }, Child::HELD);
     TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request = request_for(&log, &pids);
-    request.attached = 1;
-    request.timeout_s = 1;
     double start = seconds();
-    trace_run(&request);
+    std::vector<pid_t> pids = trace_held(&log, {child.pid()}, 0, 1);
     EXPECT_EQ(pids[0], -1);
     EXPECT_GE(seconds() - start, 0.9);
     EXPECT_FALSE(has_children());
@@ -260,10 +241,7 @@ TEST_F(TraceRun, TakesNoNoticeOfOtherChildren) {
         Child::HELD);
     Child stranger([] { _exit(3); });
     TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request = request_for(&log, &pids);
-    request.attached = 1;
-    trace_run(&request);
+    std::vector<pid_t> pids = trace_held(&log, {child.pid()});
     EXPECT_EQ(pids[0], -1);
 }
 
@@ -272,11 +250,7 @@ TEST_F(TraceRun, TakesNoNoticeOfOtherChildren) {
 TEST_F(TraceRun, TellsAnExitCallAndTheExitEventAndListsDescriptorsAtBoth) {
     Child child([] { syscall(SYS_exit_group, 3); }, Child::HELD);
     TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request =
-        request_for(&log, &pids, TRACE_SYSCALLS | TRACE_EXIT_EVENT | TRACE_LIST_FDS);
-    request.attached = 1;
-    trace_run(&request);
+    trace_held(&log, {child.pid()}, TRACE_SYSCALLS | TRACE_EXIT_EVENT | TRACE_LIST_FDS);
     using Event = std::pair<int, unsigned long>;
     EXPECT_EQ(log.events, (std::vector<Event>{{2, 3}, {1, 768}}));
     EXPECT_EQ(listings(log, child.pid()), 2);
@@ -391,11 +365,8 @@ TEST_F(TraceRun, ComplainsOfAProcessThatCannotBeResumed) {
         gone = child.pid();
     }
     TraceLog log;
-    std::vector<pid_t> pids = {gone};
-    TraceRequest request = request_for(&log, &pids);
-    request.attached = 1;
     testing::internal::CaptureStdout();
-    trace_run(&request);
+    std::vector<pid_t> pids = trace_held(&log, {gone});
     EXPECT_EQ(testing::internal::GetCapturedStdout(),
               "PTRACE_CONT failed No such process\n"
               "SYSCALL failed No such process\n"
@@ -411,19 +382,15 @@ TEST_F(TraceRun, ComplainsOfAProcessThatCannotBeResumed) {
 // ---- The calling process ----
 
 TEST_F(TraceRun, LeavesNoDescriptorBehind) {
-    int before = open_descriptors();
+    int before = count_descriptors(getpid());
     for (int round = 0; round < 5; ++round) {
         Child ending([] { _exit(0); }, Child::HELD);
         Child going_on(call_for_ever, Child::HELD);
         TraceLog log;
         log.polls_wanted = 100;
-        std::vector<pid_t> pids = {ending.pid(), going_on.pid()};
-        TraceRequest request = request_for(&log, &pids, UINT32_MAX);
-        request.attached = 1;
-        request.timeout_s = 1000;
-        trace_run(&request);
+        trace_held(&log, {ending.pid(), going_on.pid()}, UINT32_MAX, 1000);
     }
-    EXPECT_EQ(open_descriptors(), before);
+    EXPECT_EQ(count_descriptors(getpid()), before);
     EXPECT_FALSE(has_children());
 }
 

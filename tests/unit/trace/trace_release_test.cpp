@@ -3,6 +3,7 @@
 #include <pthread.h>
 #include <unistd.h>
 
+#include "support/slow_machine.h"
 #include "trace/trace_engine.h"
 #include "unit/trace/tracees.h"
 
@@ -107,7 +108,7 @@ TEST_F(TraceRun, LetsManyProcessesGoAtOnce) {
 }
 
 TEST_F(TraceRun, SurvivesProcessesThatEndWhileItLetsThemGo) {
-    for (int round = 0; round < 60; ++round) {
+    for (int round = 0; round < 60; round += is_slow_machine() ? 3 : 1) {
         auto body = [round] {
             for (int i = 0; i < round; ++i)
                 syscall(SYS_getppid);
@@ -116,10 +117,8 @@ TEST_F(TraceRun, SurvivesProcessesThatEndWhileItLetsThemGo) {
         Child first(body, Child::HELD), second(body, Child::HELD), third(body, Child::HELD);
         TraceLog log;
         log.polls_wanted = 3 * round;
-        std::vector<pid_t> pids = {first.pid(), second.pid(), third.pid()};
-        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS | TRACE_EXIT_EVENT);
-        request.attached = 1;
-        trace_run(&request);
+        std::vector<pid_t> pids = trace_held(&log, {first.pid(), second.pid(), third.pid()},
+                                             TRACE_SYSCALLS | TRACE_EXIT_EVENT);
         for (pid_t pid : pids)
             EXPECT_TRUE(pid == -1 ||
                         wait_until([&] { return waitpid(pid, nullptr, WNOHANG) != 0; }))
@@ -175,7 +174,7 @@ TEST_F(TraceRun, LeavesTheUntracedThreadsOfAProcessRunning) {
         spin_for_ever();
     });
     pid_t second = threaded.second();
-    for (int round = 0; round < 60; ++round) {
+    for (int round = 0; round < 60; round += is_slow_machine() ? 3 : 1) {
         TraceLog log;
         std::vector<pid_t> pids = {round % 2 == 0 ? child.pid() : second};
         TraceRequest request = request_for(&log, &pids);
@@ -198,11 +197,7 @@ TEST_F(TraceRun, EndsInTimeThoughAMainThreadHasEndedBeforeItsProcess) {
         },
         Child::HELD);
     TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
-    request.attached = 1;
-    request.timeout_s = 1;
-    trace_run(&request);
+    trace_held(&log, {child.pid()}, TRACE_SYSCALLS, 1);
     EXPECT_EQ(process_state(child.pid()), 'Z');
     EXPECT_TRUE(runs_free(threaded.second()));
 }
@@ -227,11 +222,7 @@ TEST_F(TraceRun, DoesNotStopAProcessThatAnotherThreadReplaced) {
         },
         Child::HELD);
     TraceLog log;
-    std::vector<pid_t> pids = {child.pid()};
-    TraceRequest request = request_for(&log, &pids);
-    request.attached = 1;
-    request.timeout_s = 1;
-    trace_run(&request);
+    trace_held(&log, {child.pid()}, 0, 1);
     EXPECT_TRUE(runs_free(child.pid())) << process_state(child.pid());
     close(pipe_fds[0]);
     close(pipe_fds[1]);

@@ -20,6 +20,7 @@
 #include "support/process_state.h"
 #include "support/run_program.h"
 #include "support/temp_dir.h"
+#include "trace/trace_engine.h"
 #include "trace/trace_request.h"
 
 // A child of the test that runs `body` and then exits with 0. With HELD it is already a tracee of
@@ -130,6 +131,16 @@ inline TraceRequest request_for(TraceLog *log, std::vector<pid_t> *pids, uint32_
     request.nr_pids = static_cast<int32_t>(pids->size());
     request.timeout_s = -1;
     return request;
+}
+
+// Traces processes that are HELD, and tells what has become of their pids.
+inline std::vector<pid_t> trace_held(TraceLog *log, std::vector<pid_t> pids, uint32_t flags = 0,
+                                     int32_t timeout_s = -1) {
+    TraceRequest request = request_for(log, &pids, flags);
+    request.attached = 1;
+    request.timeout_s = timeout_s;
+    trace_run(&request);
+    return pids;
 }
 
 // The name that a trace shows for a child of the test: of the word it was started by, what follows

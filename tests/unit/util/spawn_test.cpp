@@ -10,7 +10,9 @@
 #include <sys/wait.h>
 
 #include <string>
+#include <vector>
 
+#include "support/process_state.h"
 #include "support/temp_dir.h"
 #include "util/unique_fd.h"
 
@@ -40,11 +42,12 @@ TEST(Spawn, WiresTheThreeDescriptors) {
     EXPECT_EQ("err\n", streams.errors());
 }
 
-TEST(Spawn, PassingTheStandardDescriptorsLeavesThemAsTheyAre) {
+// Passes on a standard output with these descriptor flags as what it is.
+void expect_standard_output_kept(int flags) {
     Streams streams;
     pid_t pid = fork();
     if (pid == 0) {
-        dup2(streams.out.get(), 1);
+        dup3(streams.out.get(), 1, flags);
         const char *argv[] = {"/bin/sh", "-c", "echo here", nullptr};
         _exit(run_process_wait(argv[0], const_cast<char **>(argv), 0, 1, 2, false));
     }
@@ -52,6 +55,14 @@ TEST(Spawn, PassingTheStandardDescriptorsLeavesThemAsTheyAre) {
     waitpid(pid, &status, 0);
     EXPECT_EQ(0, status);
     EXPECT_EQ("here\n", streams.output());
+}
+
+TEST(Spawn, PassingTheStandardDescriptorsLeavesThemAsTheyAre) {
+    expect_standard_output_kept(0);
+}
+
+TEST(Spawn, AStandardDescriptorThatIsCloseOnExecIsKept) {
+    expect_standard_output_kept(O_CLOEXEC);
 }
 
 TEST(Spawn, OutputAndErrorsMayShareADescriptor) {
@@ -79,6 +90,7 @@ TEST(Spawn, AProgramThatDoesNotExistSaysSoOnItsStandardErrorAndExitsWithOne) {
 
 TEST(Spawn, TextThatTheCallerHadBufferedComesOutWhenTheProgramCannotBeExecuted) {
     Streams streams;
+    (void)fflush(stdout);  // nothing of the test's own
     pid_t pid = fork();
     if (pid == 0) {
         const char *argv[] = {"/nonexistent/program", nullptr};
@@ -124,6 +136,17 @@ TEST(Spawn, TraceMeStopsTheChildWithSigtrapAtItsExecve) {
     EXPECT_EQ(0, ptrace(PTRACE_CONT, pid, 0, 0));
     EXPECT_EQ(pid, waitpid(pid, &status, 0));
     EXPECT_EQ(0, status);
+}
+
+TEST(Spawn, KeepsNoRecordOfATracedChildThatHasOnlyStopped) {
+    const char *argv[] = {"/bin/true", nullptr};
+    EXPECT_EQ(SIGTRAP, run_process_wait(argv[0], const_cast<char **>(argv), 0, 1, 2, true));
+    const std::vector<pid_t> children = children_of(getpid());
+    ASSERT_EQ(1u, children.size());
+    release_child(children[0]);
+    EXPECT_FALSE(claim_child(children[0]));
+    EXPECT_EQ(0, kill(children[0], SIGKILL));
+    EXPECT_EQ(children[0], waitpid(children[0], nullptr, 0));
 }
 
 TEST(Spawn, AChildThatASignalKilledYieldsZero) {

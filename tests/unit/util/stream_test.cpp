@@ -3,67 +3,16 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <signal.h>
-#include <string.h>
-#include <sys/mount.h>
-#include <sys/time.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <string>
 
-#include "support/sandbox.h"
+#include "stream_pieces.h"
 #include "support/temp_dir.h"
 #include "util/unique_fd.h"
 
 namespace {
-
-struct Pipe {
-    Pipe() {
-        int ends[2];
-        EXPECT_EQ(0, pipe2(ends, O_CLOEXEC));
-        in.reset(ends[0]);
-        out.reset(ends[1]);
-    }
-    UniqueFd in;
-    UniqueFd out;
-};
-
-// As the dispatcher does for every applet.
-class Stream : public testing::Test {
-  protected:
-    void SetUp() override { signal(SIGPIPE, SIG_IGN); }
-};
-
-void ignore_signal(int) {}
-
-// Interrupts blocking calls of this process every millisecond for as long as it lives.
-class Interruptions {
-  public:
-    Interruptions() {
-        struct sigaction action = {};
-        action.sa_handler = ignore_signal;
-        sigaction(SIGALRM, &action, nullptr);
-        set_timer(1000);
-    }
-    ~Interruptions() {
-        set_timer(0);
-        signal(SIGALRM, SIG_DFL);
-    }
-
-  private:
-    static void set_timer(suseconds_t us) {
-        itimerval timer = {{0, us}, {0, us}};
-        setitimer(ITIMER_REAL, &timer, nullptr);
-    }
-};
-
-std::string pattern(size_t size) {
-    std::string text(size, '\0');
-    for (size_t i = 0; i < size; ++i)
-        text[i] = static_cast<char>('a' + i * 7 % 26);
-    return text;
-}
 
 // What `producer` writes to the pipe that it is given, read slowly enough to make it block.
 template <typename Producer>
@@ -160,59 +109,6 @@ TEST_F(Stream, ReadAllGathersPiecesAndSurvivesSignals) {
     }
     EXPECT_EQ("abababababababababab", std::string(buf, 20));
     waitpid(pid, nullptr, 0);
-}
-
-TEST_F(Stream, CopyFdOfAnEmptyFileWritesNothing) {
-    TempDir dir;
-    UniqueFd file(open(dir.file("empty", "").c_str(), O_RDONLY));
-    Pipe pipe;
-    EXPECT_EQ(0, copy_fd(file.get(), pipe.out.get()));
-    pipe.out.reset();
-    char byte;
-    EXPECT_EQ(0, read(pipe.in.get(), &byte, 1));
-}
-
-TEST_F(Stream, CopyFdCopiesEveryByteOfAnySize) {
-    TempDir dir;
-    for (int size : {1, 16383, 16384, 16385, 100000}) {
-        std::string text = pattern(static_cast<size_t>(size));
-        UniqueFd in(open(dir.file("in", text).c_str(), O_RDONLY));
-        UniqueFd out(open((dir / "out").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600));
-        EXPECT_EQ(size, copy_fd(in.get(), out.get()));
-        EXPECT_EQ(text, read_whole_file(dir / "out"));
-    }
-}
-
-TEST_F(Stream, CopyFdIntoAPipeWithoutAReaderFails) {
-    TempDir dir;
-    UniqueFd in(open(dir.file("in", "text").c_str(), O_RDONLY));
-    Pipe pipe;
-    pipe.in.reset();
-    EXPECT_EQ(-1, copy_fd(in.get(), pipe.out.get()));
-    EXPECT_EQ(EPIPE, errno);
-}
-
-TEST_F(Stream, CopyFdGoesOnAfterOtherOutputErrorsAndCountsWhatWentOut) {
-    TempDir dir;
-    UniqueFd in(open(dir.file("in", pattern(50000)).c_str(), O_RDONLY));
-    UniqueFd full(open("/dev/full", O_WRONLY));
-    EXPECT_EQ(0, copy_fd(in.get(), full.get()));
-    EXPECT_EQ(50000, lseek(in.get(), 0, SEEK_CUR));
-}
-
-TEST_F(Stream, CopyFdCountsThePartOfABlockThatAFullDiskTook) {
-    run_in_sandbox([] {
-        TempDir dir;
-        UniqueFd in(open(dir.file("in", pattern(50000)).c_str(), O_RDONLY));
-        TempDir disk;
-        ASSERT_EQ(0, mount("none", disk.path().c_str(), "tmpfs", 0, "size=20480"));
-        {
-            UniqueFd out(open((disk / "out").c_str(), O_WRONLY | O_CREAT, 0600));
-            EXPECT_EQ(20480, copy_fd(in.get(), out.get()));
-        }
-        EXPECT_EQ(pattern(20480), read_whole_file(disk / "out"));
-        umount2(disk.path().c_str(), MNT_DETACH);
-    });
 }
 
 TEST_F(Stream, BoundedWriterCutsAtItsBudgetAndThenWritesNothing) {
