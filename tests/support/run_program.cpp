@@ -3,9 +3,9 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <signal.h>
 #include <stdlib.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
@@ -110,6 +110,21 @@ Background::~Background() {
         close(err_);
 }
 
+// Forgets the lines that have been read.
+void Background::drop_taken() {
+    pending_.erase(0, taken_);
+    taken_ = 0;
+}
+
+// Takes in what `fds` has of standard output and standard error, as poll() left it.
+void Background::take_in(const pollfd fds[2]) {
+    drop_taken();
+    if (fds[0].revents != 0)
+        drain(out_, pending_);
+    if (fds[1].revents != 0)
+        drain(err_, pending_err_);
+}
+
 // Waits for output and takes it in; false when none came in time or both streams have ended.
 bool Background::fill(int timeout_ms) {
     pollfd fds[2] = {{out_, POLLIN, 0}, {err_, POLLIN, 0}};
@@ -120,26 +135,24 @@ bool Background::fill(int timeout_ms) {
         return true;
     if (ready <= 0)
         return false;
-    if (fds[0].revents != 0)
-        drain(out_, pending_);
-    if (fds[1].revents != 0)
-        drain(err_, pending_err_);
+    take_in(fds);
     return true;
 }
 
 std::string Background::read_line(int timeout_s) {
     long deadline = now_ms() + timeout_s * 1000;
     size_t end;
-    while ((end = pending_.find('\n')) == std::string::npos && out_ >= 0) {
+    while ((end = pending_.find('\n', taken_)) == std::string::npos && out_ >= 0) {
         long left = deadline - now_ms();
         if (left <= 0 || !fill(static_cast<int>(left))) {
-            ADD_FAILURE() << "no line within " << timeout_s << " s; so far: " << pending_
+            ADD_FAILURE() << "no line within " << timeout_s
+                          << " s; so far: " << pending_.substr(taken_)
                           << "\nstandard error: " << pending_err_;
             return "";
         }
     }
-    std::string line = pending_.substr(0, end);
-    pending_.erase(0, end == std::string::npos ? end : end + 1);
+    std::string line = pending_.substr(taken_, end - taken_);
+    taken_ = end == std::string::npos ? pending_.size() : end + 1;
     return line;
 }
 
@@ -165,6 +178,7 @@ void Background::close_output() {
         close(out_);
     out_ = -1;
     pending_.clear();
+    taken_ = 0;
 }
 
 void Background::send_signal(int signo) {
@@ -175,26 +189,31 @@ void Background::send_signal(int signo) {
 RunResult Background::wait(int timeout_s) {
     close_input();
     long deadline = now_ms() + timeout_s * 1000;
-    int status = 0;
     // Its output may be held open by others that live on: its own end is what counts.
-    for (;;) {
-        pid_t waited = waitpid(pid_, &status, WNOHANG);
-        if (waited == pid_)
-            break;
-        if (now_ms() > deadline) {
+    int end = open_process(pid_);
+    pollfd fds[3] = {{out_, POLLIN, 0}, {err_, POLLIN, 0}, {end, POLLIN, 0}};
+    while (fds[2].revents == 0) {
+        long left = deadline - now_ms();
+        if (left <= 0) {
             ADD_FAILURE() << "still running after " << timeout_s
                           << " s; standard output: " << pending_
                           << "\nstandard error: " << pending_err_;
             kill(pid_, SIGKILL);
-            waitpid(pid_, &status, 0);
             break;
         }
-        if (!fill(10) && out_ < 0 && err_ < 0)
-            usleep(2000);
+        if (poll(fds, 3, static_cast<int>(left)) <= 0)
+            continue;
+        take_in(fds);
+        fds[0].fd = out_;
+        fds[1].fd = err_;
     }
+    close(end);
+    int status = 0;
+    waitpid(pid_, &status, 0);
     pid_ = -1;
     while (fill(0)) {
     }
+    drop_taken();
     RunResult result = result_of(status);
     result.out = std::move(pending_);
     result.err = std::move(pending_err_);
@@ -222,6 +241,15 @@ std::string fieldkit_path() {
 std::string fixture_path(const std::string &name) {
     const char *dir = getenv("FIXTURES");
     return std::string(dir != nullptr ? dir : FIXTURE_DIR) + "/" + name;
+}
+
+int open_process(pid_t pid) {
+    int fd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
+    if (fd < 0) {
+        perror("pidfd_open");
+        abort();
+    }
+    return fd;
 }
 
 bool wait_until(const std::function<bool()> &condition, int timeout_s) {

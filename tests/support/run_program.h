@@ -1,6 +1,7 @@
 // Runs programs as a user would and collects what came of it.
 #pragma once
 
+#include <poll.h>
 #include <sys/types.h>
 
 #include <functional>
@@ -55,12 +56,15 @@ class Background {
     RunResult wait(int timeout_s = 60);
 
   private:
+    void drop_taken();
+    void take_in(const pollfd fds[2]);
     bool fill(int timeout_ms);
     pid_t pid_ = -1;
     int in_ = -1;
     int out_ = -1;
     int err_ = -1;
     std::string pending_;
+    size_t taken_ = 0;  // of it, by read_line()
     std::string pending_err_;
 };
 
@@ -68,5 +72,7 @@ class Background {
 std::string fieldkit_path();
 // A program of tests/system/fixtures: below FIXTURES in the environment, else as built.
 std::string fixture_path(const std::string &name);
+// A descriptor of the process `pid` that can be read once it has ended.
+int open_process(pid_t pid);
 // Waits until `condition` holds, at most `timeout_s`; returns whether it did.
 bool wait_until(const std::function<bool()> &condition, int timeout_s = 20);

@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sched.h>
 #include <signal.h>
 #include <stdio.h>
@@ -127,12 +128,14 @@ void run_in_sandbox(const std::function<void()> &body, const SandboxOptions &opt
     ASSERT_GE(pid, 0);
     if (pid == 0)
         run_sandbox(body, options);
-    int status = 0;
-    bool ended =
-        wait_until([&] { return waitpid(pid, &status, WNOHANG) == pid; }, options.timeout_s);
-    if (!ended) {
+    pollfd end = {open_process(pid), POLLIN, 0};
+    const bool ended = poll(&end, 1, options.timeout_s * 1000) == 1;
+    close(end.fd);
+    if (!ended)
         kill(pid, SIGKILL);
-        waitpid(pid, &status, 0);
+    int status = 0;
+    waitpid(pid, &status, 0);
+    if (!ended) {
         FAIL() << "the sandbox was still running after " << options.timeout_s << " s";
     }
     ASSERT_TRUE(WIFEXITED(status));
