@@ -2,14 +2,24 @@
 
 #include <stdlib.h>
 
-bool is_slow_machine() {
+namespace {
+
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-    return true;
+constexpr bool SANITIZED = true;
 #else
-    return getenv("FIELDKIT_LOAD_MODULES") != nullptr;
+constexpr bool SANITIZED = false;
 #endif
+
+bool is_board() {
+    return getenv("FIELDKIT_LOAD_MODULES") != nullptr;
+}
+
+}  // namespace
+
+bool is_slow_machine() {
+    return SANITIZED || is_board();
 }
 
 int rounds(int many) {
-    return is_slow_machine() ? many / 3 : many;
+    return is_board() ? many / 10 : SANITIZED ? many / 3 : many;
 }
