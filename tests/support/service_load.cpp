@@ -1,6 +1,7 @@
 #include "support/service_load.h"
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -35,6 +36,17 @@ std::string cheap_core_writer(const TempDir &dir) {
                     "echo \"CORELEN ${#core} bytes, of processes:$3\" >&2\n"
                     "printf %s \"$core\"\n",
                     0755);
+}
+
+size_t more_than_buffers_hold() {
+    size_t held = 0;
+    for (const char *name : {"tcp_wmem", "tcp_rmem"}) {
+        const std::string sizes = read_whole_file(std::string("/proc/sys/net/ipv4/") + name);
+        size_t largest = 0;
+        EXPECT_EQ(1, sscanf(sizes.c_str(), "%*u %*u %zu", &largest)) << name;
+        held += largest;
+    }
+    return (held / 65536 + 32) * 65536;
 }
 
 std::vector<int> traced_processes() {

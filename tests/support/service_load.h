@@ -23,6 +23,9 @@ class ServiceLog {
 // program.
 std::string cheap_core_writer(const TempDir &dir);
 
+// More bytes than a connection over loopback holds that nobody reads from; a multiple of 64 KiB.
+size_t more_than_buffers_hold();
+
 // The processes in sight that some process traces.
 std::vector<int> traced_processes();
 // Waits until there is none.

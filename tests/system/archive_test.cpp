@@ -17,6 +17,7 @@
 #include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/service_load.h"
+#include "support/slow_machine.h"
 #include "support/tar_reader.h"
 #include "support/temp_dir.h"
 
@@ -336,7 +337,8 @@ TEST(Archive, EndsQuietlyOnAFullDisk) {
 TEST(Archive, SurvivesProcessesThatComeAndGoWhileItIsMade) {
     run_in_sandbox([] {
         TempDir dir;
-        Background churn({"/bin/sh", "-c", "while :; do /bin/sleep 0.002; done"});
+        const std::string pause = is_slow_machine() ? "0.03" : "0.002";
+        Background churn({"/bin/sh", "-c", "while :; do /bin/sleep " + pause + "; done"});
         Background brief({"/bin/sleep", "2"});
         RunResult result = run_fieldkit({"debugar.cgi", "-d", "-p", cheap_core_writer(dir)});
         EXPECT_EQ(0, result.exit_status);

@@ -33,15 +33,14 @@ inline const char *const SERVICE_SOCKET = "/var/run/dbg-cgi/ctrl-segf-socket";
 
 // Bytes of which no two blocks are the same, zeros included.
 inline std::string made_up_core(size_t size) {
-    std::string core =
-        "\x7f"
-        "ELF";
+    std::vector<uint32_t> words(size / 4 + 1);
     uint32_t state = 1;
-    while (core.size() < size) {
-        state = state * 1664525 + 1013904223;
-        core.push_back(static_cast<char>(state >> 24));
-    }
-    return core;
+    for (uint32_t &word : words)
+        word = state = state * 1664525 + 1013904223;
+    std::string core(reinterpret_cast<const char *>(words.data()), size);
+    return core.replace(0, std::min<size_t>(size, 4),
+                        "\x7f"
+                        "ELF");
 }
 
 inline double now_s() {

@@ -384,7 +384,7 @@ TEST_F(OnTheNetwork, TheTimeLimitOfACaptureLeavesNoPromiscuousMode) {
 TEST_F(OnTheNetwork, TheSizeLimitOfACaptureLeavesNoPromiscuousMode) {
     run_in_sandbox(
         [&] {
-            Talker talker(connect_to_echo(), 0);
+            Talker talker(connect_to_echo(), 2000);
             const RunResult result = run_fieldkit({"debugar.cgi", "-dt", "-p", "/nonexistent"});
             // As many as fit.
             EXPECT_EQ(329u, captured_frames(result.out).size());

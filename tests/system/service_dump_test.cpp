@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <numeric>
 #include <string>
 #include <vector>
 
@@ -16,16 +17,13 @@
 #include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/service.h"
-#include "support/slow_machine.h"
+#include "support/service_load.h"
 #include "support/system_log.h"
 #include "support/temp_dir.h"
 
 namespace {
 
 constexpr int DAEMON_ERROR = 3 << 3 | 3;  // facility and priority in the system log
-
-// More than what is under way to a client that does not read.
-const size_t LARGE_FILE = (is_slow_machine() ? 12 : 64) << 20;
 
 std::string download(const std::string &name, const std::string &contents) {
     return ok_header("application/octet-stream", name) + contents;
@@ -112,10 +110,9 @@ void limit_descriptors(pid_t pid, rlim_t count) {
 }
 
 std::string large_core() {
-    std::string core;
-    for (int i = 0; core.size() < 3000000; ++i)
-        core += std::to_string(i) + '\0';
-    return core;
+    std::vector<int> words(750000);
+    std::iota(words.begin(), words.end(), 0);
+    return std::string(reinterpret_cast<const char *>(words.data()), words.size() * sizeof(int));
 }
 
 TEST(ServiceDumps, ACrashCoreThatNobodyWaitsForIsReadByNobodyAndDismissedAtOnce) {
@@ -356,7 +353,7 @@ TEST(ServiceDumps, AFileWhoseClientLeavesHalfWayStaysWhole) {
     run_in_sandbox([] {
         SystemLog log;
         TempDir dir;
-        const std::string material(LARGE_FILE, 'm');
+        const std::string material(more_than_buffers_hold(), 'm');
         dir.file("dumps/big", material);
         Service service({.dump_dir = dir / "dumps"});
         Client client = wait_for_dump(service);
@@ -373,7 +370,7 @@ TEST(ServiceDumps, AFileWhoseClientLeavesHalfWayStaysWhole) {
 TEST(ServiceDumps, AServiceThatIsKilledInTheMiddleOfASpoolFileLeavesItWhole) {
     run_in_sandbox([] {
         TempDir dir;
-        const std::string material(LARGE_FILE, 'm');
+        const std::string material(more_than_buffers_hold(), 'm');
         dir.file("dumps/big", material);
         Service service({.dump_dir = dir / "dumps"});
         Client client = wait_for_dump(service);

@@ -254,9 +254,6 @@ TEST(ServiceLoad, ManyClientsGetWellFormedRepliesAndNothingIsLeftOfThem) {
 
 // ---- Clients that do not read
 
-// More than all buffers on the way hold, and four times of it fit into a board's memory.
-const size_t FLOOD = (is_slow_machine() ? 12 : 40) << 20;
-
 // Waits until so much has come, unread, that the sender must be about to wait for its reader.
 bool is_flooded(const Client &client) {
     return wait_until([&] {
@@ -269,9 +266,10 @@ TEST(ServiceLoad, ClientsThatStopReadingHoldUpNobodyElse) {
     run_in_sandbox(
         [] {
             TempDir dir;
-            std::string size = std::to_string(FLOOD);
+            const size_t flood_size = more_than_buffers_hold();
+            std::string size = std::to_string(flood_size);
             std::string flood =
-                "/bin/dd if=/dev/zero bs=65536 count=" + std::to_string(FLOOD / 65536) +
+                "/bin/dd if=/dev/zero bs=65536 count=" + std::to_string(flood_size / 65536) +
                 " 2>/dev/null\n";
             std::string writer = dir.file(
                 "writer",
@@ -306,11 +304,11 @@ TEST(ServiceLoad, ClientsThatStopReadingHoldUpNobodyElse) {
             trace.close();
 
             // Those that go on get all of it.
-            EXPECT_EQ(FLOOD, body_of(listing.read_all()).size());
-            EXPECT_EQ(FLOOD, body_of(capture.read_all()).size());
+            EXPECT_EQ(flood_size, body_of(listing.read_all()).size());
+            EXPECT_EQ(flood_size, body_of(capture.read_all()).size());
             std::vector<TarMember> members = read_tar(body_of(archive.read_all()));
-            EXPECT_TRUE(std::any_of(members.begin(), members.end(), [](const TarMember &member) {
-                return member.data.size() == FLOOD;
+            EXPECT_TRUE(std::any_of(members.begin(), members.end(), [&](const TarMember &member) {
+                return member.data.size() == flood_size;
             }));
             samples.close();
             EXPECT_TRUE(service.is_at_rest());
@@ -453,7 +451,10 @@ TEST(ServiceLoad, HostileQueriesGetAReplyAndLeaveNothingBehind) {
             EXPECT_EQ(SERVER_ERROR, service.send(std::string(4095, 'p')).read_all());
             EXPECT_EQ(SERVER_ERROR, service.send("p").read_all());
             close(service.connect_segf());
-            EXPECT_TRUE(service.is_at_rest());
+            // Dozens of traces have had to wait for each other.
+            EXPECT_TRUE(service.is_at_rest(60))
+                << service.descriptors() << " descriptors, " << service.threads() << " threads, "
+                << service.children() << " children";
             EXPECT_EQ("", log.report());
         },
         WITH_ETH0);

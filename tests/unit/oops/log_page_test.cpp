@@ -7,6 +7,7 @@
 #include <string>
 
 #include "support/oops_image.h"
+#include "support/slow_machine.h"
 
 namespace {
 
@@ -111,7 +112,7 @@ std::string plain_text_of(const std::string &page) {
 
 TEST(LogText, OfAnyPageIsWhatIsFoundAByteAtATime) {
     std::minstd_rand random(1);
-    for (int round = 0; round < 2000; ++round) {
+    for (int round = 0; round < rounds(600); ++round) {
         // Down to pages without an erased byte, which are rare where each byte may be one.
         const unsigned highest = round % 2 == 0 ? 0xff : 0xfe;
         std::string page = oops_page(1, "");

@@ -326,7 +326,7 @@ TEST_F(WaitForChild, WorksInAForkedChildWhileOtherThreadsForkAndWait) {
             all_done.arrive_and_wait();
         });
     }
-    for (int round = 0; round < 100; ++round) {
+    for (int round = 0; round < rounds(100); ++round) {
         pid_t pid = fork_child(false);
         if (pid == 0) {
             int status = -1;
