@@ -26,7 +26,8 @@ constexpr uint32_t DEFAULT_BUF_SIZE = 4096;
 constexpr uint32_t IN_SYSCALL = 1;            // the bit of TracedProcess::in_syscall
 constexpr int SYSCALL_STOP = SIGTRAP | 0x80;  // as PTRACE_O_TRACESYSGOOD marks it
 constexpr long HELD_POLL_MS = 50;
-constexpr unsigned TIMER_LOOK_EVENTS = 64;
+constexpr unsigned LOOK_EVENTS = 64;
+constexpr int LOOK_PROCESSES = 8;
 
 // One trace at a time: the wait for any child would otherwise take the other trace's events.
 pthread_mutex_t trace_mutex = PTHREAD_MUTEX_INITIALIZER;
@@ -38,6 +39,8 @@ struct Trace {
     int held;           // processes with TracedProcess::held
     pid_t timer;        // the child that measures the time limit, or -1
     unsigned events;    // that were waited for so far
+    int looks_left;     // how many processes are to be asked by themselves
+    int looked_at;      // index of the last one that was
     int64_t looked_ms;  // when held processes were last looked after
 };
 
@@ -239,13 +242,35 @@ bool await_child_signal() {
     return sigtimedwait(&child_signal, nullptr, &limit) != -1 || errno == EAGAIN;
 }
 
+// Asks the next ones of the processes that are still to be asked by themselves; 0 when none of them
+// has something to tell.
+pid_t look_at_next(Trace *trace, int *status) {
+    const TraceRequest &request = *trace->request;
+    while (trace->looks_left > 0) {
+        --trace->looks_left;
+        trace->looked_at = (trace->looked_at + 1) % request.nr_pids;
+        pid_t pid = request.pids[trace->looked_at];
+        if (pid != -1 && wait_as_tracer(pid, status, WNOHANG | __WALL) == pid)
+            return pid;
+    }
+    return 0;
+}
+
 // waitpid for any child or tracee.
 pid_t wait_for_event(Trace *trace, int *status) {
-    // The kernel looks at older children first, and a busy one of these always has something to
-    // tell on a single processor: the end of the timer would never be heard of.
-    if (trace->timer != -1 && ++trace->events % TIMER_LOOK_EVENTS == 0 &&
-        wait_as_tracer(trace->timer, status, WNOHANG) == trace->timer)
-        return trace->timer;
+    // The kernel looks at them in an order of its own. Where busy ones come first, which always
+    // have something to tell, nothing would be heard of the others, nor of the end of the timer: so
+    // these are asked by themselves now and then, some processes at a time.
+    if (++trace->events % LOOK_EVENTS == 0) {
+        trace->looks_left = trace->request->nr_pids > 1 ? LOOK_PROCESSES : 0;
+        if (trace->timer != -1 && wait_as_tracer(trace->timer, status, WNOHANG) == trace->timer)
+            return trace->timer;
+        if (trace->held > 0)
+            step_continued(trace);
+    }
+    pid_t next = look_at_next(trace, status);
+    if (next != 0)
+        return next;
     while (trace->held > 0) {
         pid_t pid = wait_as_tracer(-1, status, WNOHANG | __WALL);
         if (pid != 0)
@@ -346,8 +371,14 @@ void run_trace(Trace *trace) {
 }
 
 void run(TraceRequest *request) {
-    Trace trace = {
-        .request = request, .live = 0, .held = 0, .timer = -1, .events = 0, .looked_ms = 0};
+    Trace trace = {.request = request,
+                   .live = 0,
+                   .held = 0,
+                   .timer = -1,
+                   .events = 0,
+                   .looks_left = 0,
+                   .looked_at = 0,
+                   .looked_ms = 0};
     sigset_t child_signal;
     sigset_t before;
     (void)sigemptyset(&child_signal);

@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <time.h>
 
+#include <algorithm>
 #include <atomic>
 #include <thread>
 
@@ -92,6 +93,26 @@ TEST_F(TraceRun, ACallbackThatRefusesAtItsFirstPollEndsItAfterTheFirstWait) {
     EXPECT_EQ(log.all(), "");
     EXPECT_TRUE(runs_free(child.pid()));
     EXPECT_EQ(waitpid(-1, nullptr, WNOHANG), 0) << "only the traced process is left as a child";
+}
+
+TEST_F(TraceRun, HearsOfEachOfSeveralBusyProcesses) {
+    Child first(call_for_ever), second(call_for_ever), third(call_for_ever);
+    TraceLog log;
+    log.polls_wanted = 1000;
+    // Meanwhile the others get to their next stops: one is always waiting to be heard.
+    log.end_when = [] {
+        usleep(200);
+        return false;
+    };
+    std::vector<pid_t> pids = {first.pid(), second.pid(), third.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    trace_run(&request);
+    for (const pid_t pid : pids) {
+        const std::string name = "[" + std::to_string(pid) + " ";
+        EXPECT_LT(10, std::count_if(log.texts.begin(), log.texts.end(), [&](const auto &text) {
+                      return text.find(name) != std::string::npos;
+                  }));
+    }
 }
 
 TEST_F(TraceRun, StopsItsTimerWithSigint) {
