@@ -21,7 +21,7 @@ int list_fds(pid_t pid, int *fds, int max);
 // With `sockets`, sockets are looked up there, which is for many descriptors at one moment.
 //
 // Keeps descriptors to be quick for the same process, and for sockets, again; forget_last_process
-// closes them.
+// closes them, and has everything tried anew.
 int describe_fd(pid_t pid, int fd, char *buf, size_t size, SocketSnapshot *sockets = nullptr);
 void forget_last_process();
 

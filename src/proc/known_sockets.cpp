@@ -108,3 +108,8 @@ bool sockets_can_be_known() {
     Lock guard;
     return silence < MAX_SILENCE;
 }
+
+void ask_about_sockets_again() {
+    Lock guard;
+    silence = 0;
+}

@@ -20,3 +20,7 @@ void remember_unix_socket(unsigned long inode, const char *name, int name_length
 
 // Whether the kernel answers; no more sockets need to be remembered otherwise.
 bool sockets_can_be_known();
+
+// Has the kernel asked again after all: connections that ended one after the other are answered as
+// little as anything is by a kernel that never does.
+void ask_about_sockets_again();
