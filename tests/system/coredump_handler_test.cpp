@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "core_runs.h"
+#include "support/refused_calls.h"
 
 namespace {
 
@@ -280,23 +281,23 @@ TEST(CoredumpService, ThatCannotBeReachedIsNamedOnStandardError) {
 }
 
 TEST(CoredumpService, IsLeftSilentlyWhenThereIsNoSocket) {
-    if (!has_call_filters())
+    if (!can_refuse_calls())
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     run_in_sandbox([] {
         CoreDevice device;
-        HandlerRun run("core", UNLIMITED, [] { forbid_call(SYS_socket, EMFILE); });
+        HandlerRun run("core", UNLIMITED, [] { (void)refuse_call(SYS_socket, EMFILE); });
         run.expect_end(1);
         EXPECT_EQ(0, run.taken());
     });
 }
 
 TEST(CoredumpService, GetsTheCoreAlsoWhenTheWaitForItsAnswerFails) {
-    if (!has_call_filters())
+    if (!can_refuse_calls())
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     run_in_sandbox([] {
         CoreDevice device;
         FakeService service;
-        HandlerRun run("core", UNLIMITED, [] { forbid_call(SYS_poll, EINTR); });
+        HandlerRun run("core", UNLIMITED, [] { (void)refuse_call(SYS_poll, EINTR); });
         Connection connection = service.take_caller();
         EXPECT_EQ("core", connection.take_all());
         const RunResult result = run.wait();
@@ -326,7 +327,7 @@ TEST(CoredumpStart, LeavesNoSocketInThePlaceOfAClosedStream) {
 }
 
 TEST(CoredumpStart, MixesNoMessageIntoTheCore) {
-    if (!has_call_filters())
+    if (!can_refuse_calls())
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     run_in_sandbox([] {
         CoreDevice device;
@@ -334,7 +335,7 @@ TEST(CoredumpStart, MixesNoMessageIntoTheCore) {
         // The wait fails, which is told on standard error.
         HandlerRun run("core", UNLIMITED, [] {
             close(STDERR_FILENO);
-            forbid_call(SYS_poll, EINTR);
+            (void)refuse_call(SYS_poll, EINTR);
         });
         EXPECT_EQ("core", service.take_caller().take_all());
         run.expect_end(0);

@@ -2,14 +2,10 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/filter.h>
 #include <linux/fs.h>
-#include <linux/seccomp.h>
 #include <mtd/mtd-user.h>
-#include <stddef.h>
 #include <stdio.h>
 #include <string.h>
-#include <sys/prctl.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -22,6 +18,7 @@
 
 #include "support/log_devices.h"
 #include "support/oops_image.h"
+#include "support/refused_calls.h"
 #include "support/run_program.h"
 #include "support/temp_dir.h"
 
@@ -281,32 +278,16 @@ TEST(OopslogOnEachDevice, SurvivesRandomBytes) {
                   "Last log is at position 20 with count 42\n");
 }
 
-// In a child: from here on ioctl `request` fails with EIO.
-void forbid_ioctl(unsigned long request) {
-    sock_filter program[] = {
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_ioctl, 0, 3),
-        // The low half: both machines are little-endian.
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, args[1])),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, static_cast<uint32_t>(request), 0, 1),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | EIO),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-    };
-    const sock_fprog filter = {.len = sizeof(program) / sizeof(program[0]), .filter = program};
-    if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
-        prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter, 0, 0) != 0)
-        perror("seccomp");
-}
-
 TEST(OopslogOnEachDevice, NamesTheQuestionForTheSizeWhenItFails) {
-    // Where the kernel knows filters it is the missing one that it complains about.
-    if (prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, nullptr, 0, 0) != 0 && errno != EFAULT)
+    if (!can_refuse_calls())
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     with_each_device(FIVE_TO_SEVEN, [&](const std::string &device) {
         const bool block = std::filesystem::is_block_file(device);
+        const CallArgument question = {
+            .index = 1, .value = static_cast<unsigned>(block ? BLKGETSIZE : MEMGETINFO)};
         RunResult result =
             run_fieldkit({"oopslog", device},
-                         {.before_exec = [&] { forbid_ioctl(block ? BLKGETSIZE : MEMGETINFO); }});
+                         {.before_exec = [&] { (void)refuse_call(SYS_ioctl, EIO, question); }});
         EXPECT_EQ(1, result.exit_status);
         EXPECT_EQ("", result.out);
         EXPECT_EQ(block ? "BLKGETSIZE: Input/output error\n" : "MEMGETINFO: Input/output error\n",
@@ -316,11 +297,14 @@ TEST(OopslogOnEachDevice, NamesTheQuestionForTheSizeWhenItFails) {
 
 TEST(OopslogOnEachDevice, ReadsAPageWhoseBlockIsNotSaidToBeGoodOrBad) {
     // The question does not exist for block devices, and fails on flash.
-    if (prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, nullptr, 0, 0) != 0 && errno != EFAULT)
+    if (!can_refuse_calls())
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     with_each_device(oops_page(1, "one\n"), [](const std::string &device) {
-        RunResult result = run_fieldkit({"oopslog", device},
-                                        {.before_exec = [] { forbid_ioctl(MEMGETBADBLOCK); }});
+        RunResult result =
+            run_fieldkit({"oopslog", device}, {.before_exec = [] {
+                             (void)refuse_call(SYS_ioctl, EIO,
+                                               CallArgument{.index = 1, .value = MEMGETBADBLOCK});
+                         }});
         EXPECT_EQ(0, result.exit_status);
         EXPECT_EQ("Log Entry 1 (at position 0)\none\n", result.out);
     });

@@ -1,14 +1,18 @@
 // A file that a test writes an archive to.
 #pragma once
 
+#include <errno.h>
 #include <fcntl.h>
 #include <signal.h>
+#include <stdio.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <string>
 #include <vector>
 
 #include "archive/tar_writer.h"
+#include "support/refused_calls.h"
 #include "support/tar_reader.h"
 #include "support/temp_dir.h"
 #include "util/unique_fd.h"
@@ -41,3 +45,11 @@ struct BrokenArchive {
     UniqueFd fd;
     TarWriter *tw;
 };
+
+// From here on no range of descriptors can be closed with one call, as before Linux 5.9.
+inline void be_an_old_kernel() {
+#ifdef SYS_close_range
+    if (!refuse_call(SYS_close_range, ENOSYS))
+        perror("seccomp");
+#endif
+}

@@ -1,21 +1,16 @@
 #include "archive/gzip_stream.h"
 
-#include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/filter.h>
-#include <linux/seccomp.h>
 #include <signal.h>
-#include <stddef.h>
 #include <stdio.h>
-#include <sys/prctl.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <zlib.h>
 
 #include <string>
 
+#include "archive_file.h"
 #include "support/gunzip.h"
 #include "support/temp_dir.h"
 
@@ -123,22 +118,6 @@ TEST(GzipFilter, EndsAndClosesItsInputWhenTheReaderHasGone) {
     close(piped.in);
 }
 
-// In a child: from here on the kernel does not know how to close a range of descriptors.
-void forbid_close_range() {
-#ifdef SYS_close_range
-    sock_filter program[] = {
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_close_range, 0, 1),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | ENOSYS),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-    };
-    const sock_fprog filter = {.len = sizeof(program) / sizeof(program[0]), .filter = program};
-    if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
-        prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter, 0, 0) != 0)
-        perror("seccomp");
-#endif
-}
-
 TEST(GzipChild, KeepsNoDescriptorOfAnotherRequest) {
     for (bool old_kernel : {false, true}) {
         int in[2], out[2], other[2];
@@ -153,7 +132,7 @@ TEST(GzipChild, KeepsNoDescriptorOfAnotherRequest) {
             for (int &copy : copies)
                 copy = dup(other[1]);
             if (old_kernel)
-                forbid_close_range();
+                be_an_old_kernel();
             run_gzip_child(in[0], out[1]);
         }
         close(in[0]);

@@ -1,15 +1,12 @@
 #include "mon/monitor.h"
 
+#include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <linux/filter.h>
-#include <linux/seccomp.h>
 #include <pthread.h>
 #include <signal.h>
-#include <stddef.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/prctl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -26,6 +23,7 @@
 #include "mon/mon.h"
 #include "mon/monitor_thread.h"
 #include "support/process_state.h"
+#include "support/refused_calls.h"
 #include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/temp_dir.h"
@@ -547,22 +545,9 @@ TEST(MonitorThread, ReportsAtOnceFromTheIdleClassAndThenSleepsThroughSignals) {
     });
 }
 
-// Has the kernel refuse a system call from now on.
-bool forbid(unsigned int number) {
-    sock_filter program[] = {
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 1),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | EPERM),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-    };
-    const sock_fprog filter = {.len = sizeof program / sizeof program[0], .filter = program};
-    return prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
-           prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter, 0, 0) == 0;
-}
-
 TEST(MonitorThread, EndsWithAWordWhenItCannotHaveTheIdleClass) {
     run_in_sandbox([] {
-        if (!forbid(SYS_sched_setscheduler))
+        if (!refuse_call(SYS_sched_setscheduler, EPERM))
             GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
         TempDir dir;
         sandbox_bind(dir.path(), "/var/run/dbg-cgi");

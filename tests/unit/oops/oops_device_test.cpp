@@ -2,12 +2,8 @@
 
 #include <errno.h>
 #include <gtest/gtest.h>
-#include <linux/filter.h>
-#include <linux/seccomp.h>
-#include <stddef.h>
 #include <stdio.h>
 #include <string.h>
-#include <sys/prctl.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -15,6 +11,7 @@
 
 #include "oops/oopslog.h"
 #include "support/oops_image.h"
+#include "support/refused_calls.h"
 #include "support/temp_dir.h"
 
 namespace {
@@ -52,33 +49,22 @@ TEST(OopsDeviceDeathTest, ThatIsNoDeviceIsTakenForFlashAndTellsNoSize) {
 }
 
 // From here on every call that fstat may be made of fails with EIO.
-void forbid_fstat() {
-    sock_filter program[] = {
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
+void refuse_fstat() {
 #ifdef SYS_fstat64
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_fstat64, 3, 0),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_fstatat64, 2, 0),
+    constexpr long NUMBERS[] = {SYS_fstat64, SYS_fstatat64, SYS_statx};
 #else
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_fstat, 3, 0),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_newfstatat, 2, 0),
+    constexpr long NUMBERS[] = {SYS_fstat, SYS_newfstatat, SYS_statx};
 #endif
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, SYS_statx, 1, 0),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | EIO),
-    };
-    const sock_fprog filter = {.len = sizeof(program) / sizeof(program[0]), .filter = program};
-    if (prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0 ||
-        prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &filter, 0, 0) != 0)
-        perror("seccomp");
+    for (long number : NUMBERS)
+        EXPECT_TRUE(refuse_call(number, EIO));
 }
 
 TEST(OopsDeviceDeathTest, WhoseStatusIsRefusedIsAnError) {
-    // Where the kernel knows filters it is the missing one that it complains about.
-    if (prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, nullptr, 0, 0) != 0 && errno != EFAULT)
+    if (!can_refuse_calls())
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     EXPECT_EXIT(
         {
-            forbid_fstat();
+            refuse_fstat();
             run_and_exit("/dev/null");
         },
         testing::ExitedWithCode(1), "^stat: Input/output error\n$");

@@ -1,24 +1,19 @@
 // A capture that runs while the test looks at what it writes.
 #pragma once
 
-#include <errno.h>
 #include <gtest/gtest.h>
 #include <linux/filter.h>
-#include <linux/seccomp.h>
 #include <poll.h>
-#include <stddef.h>
 #include <stdint.h>
 #include <string.h>
-#include <sys/prctl.h>
 #include <sys/socket.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
-#include <optional>
 #include <string>
 #include <thread>
 
 #include "pcap/capture.h"
+#include "support/refused_calls.h"
 #include "support/sandbox.h"
 
 const SandboxOptions WITH_ETH0 = {.eth0 = true};
@@ -33,33 +28,6 @@ struct CaptureOptions {
     // What captures: the code under test, or a plain way that is known to be right.
     decltype(&capture_packets) capture = capture_packets;
 };
-
-// One of the six arguments of a system call, from 0.
-struct CallArgument {
-    unsigned index;
-    unsigned value;
-};
-
-// Makes a system call, or only those with this argument, fail with `error` from now on. Says
-// whether the machine can do that.
-inline bool refuse_call(unsigned number, unsigned error,
-                        std::optional<CallArgument> argument = std::nullopt) {
-    const CallArgument wanted = argument.value_or(CallArgument{0, 0});
-    sock_filter code[] = {
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS, offsetof(seccomp_data, nr)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, number, 0, 3),
-        // The low half of the argument on these little-endian machines.
-        BPF_STMT(BPF_LD | BPF_W | BPF_ABS,
-                 static_cast<uint32_t>(offsetof(seccomp_data, args) + wanted.index * 8)),
-        BPF_JUMP(BPF_JMP | BPF_JEQ | BPF_K, wanted.value, 0,
-                 static_cast<uint8_t>(argument ? 1 : 0)),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ERRNO | error),
-        BPF_STMT(BPF_RET | BPF_K, SECCOMP_RET_ALLOW),
-    };
-    sock_fprog program = {.len = 6, .filter = code};
-    return prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) == 0 &&
-           prctl(PR_SET_SECCOMP, SECCOMP_MODE_FILTER, &program, 0, 0) == 0;
-}
 
 inline int64_t capture_into(int out_fd, const CaptureOptions &options) {
     return options.capture(options.interface.c_str(), out_fd, options.size_limit,
