@@ -147,8 +147,11 @@ void write_archive_gz(int out_fd) {
         (void)close(ends[1]);
         return;
     }
-    if (pid == 0)
+    if (pid == 0) {
+        // By its number, whatever becomes of the others: with it open the input would never end.
+        (void)close(ends[1]);
         run_gzip_child(ends[0], out_fd);
+    }
     (void)close(ends[0]);
     write_archive(ends[1], pid);
     (void)close(ends[1]);
