@@ -157,10 +157,7 @@ void stop_probes(Probes *probes) {
         probe.write_end.reset();
     }
     for (const Probe &probe : probes->started) {
-        // A probe that was never started must not be signalled: to kill(), -1 is every process.
-        if (probe.pid <= 0)
-            continue;
-        (void)kill(probe.pid, SIGTERM);  // one that has ended by itself is there until it is reaped
+        signal_child(probe.pid, SIGTERM);
         (void)wait_for_child(probe.pid, nullptr);
     }
 }

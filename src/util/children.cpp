@@ -3,6 +3,7 @@
 
 #include <errno.h>
 #include <pthread.h>
+#include <signal.h>
 #include <stdlib.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -243,6 +244,14 @@ pid_t wait_for_child(pid_t pid, int *status) {
         return -1;  // to the kernel that would be any child
     int own_status;
     return wait_for_end(pid, status != nullptr ? status : &own_status);
+}
+
+void signal_child(pid_t pid, int sig) {
+    // A tracer may have reaped it in this instant; a number is not given out again that soon.
+    Lock lock;
+    const ChildEntry *entry = find(pid);
+    if (pid > 0 && entry != nullptr && !entry->ended)
+        (void)kill(pid, sig);
 }
 
 void forget_child(pid_t pid) {

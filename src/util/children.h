@@ -20,6 +20,11 @@ pid_t fork_child(bool trace_me);
 // If the calling thread itself has claimed the child, its next stop is a result, too.
 pid_t wait_for_child(pid_t pid, int *status);
 
+// Sends `sig` to the child `pid`, unless a tracer has reaped it: the number may be another
+// process's by now. To a `pid` of -1, which the kernel would take for every process, it sends
+// nothing.
+void signal_child(pid_t pid, int sig);
+
 // Keeps no status for the child `pid`: its parent waits for it in another way, in the thread that
 // traces, or not at all any more.
 void forget_child(pid_t pid);

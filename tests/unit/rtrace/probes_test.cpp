@@ -11,10 +11,12 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <fstream>
 #include <string>
 #include <vector>
 
 #include "probe_stand_ins.h"
+#include "util/children.h"
 
 namespace {
 
@@ -188,6 +190,30 @@ TEST(StopProbes, ReapsAProbeThatEndedByItself) {
         stop_probes(&probes);
         EXPECT_TRUE(is_gone(pid));
         EXPECT_FALSE(has_children());
+    });
+}
+
+TEST(StopProbes, SignalsNobodyWhoHasGotTheNumberOfAProbeThatATracerReaped) {
+    run_in_sandbox([] {
+        stand_in_for_probes();
+        Probes probes;
+        start_probes(0x200, 1, &probes);
+        const pid_t pid = probes.started[0].pid;
+        kill(pid, SIGKILL);
+        int status;
+        ASSERT_EQ(pid, wait_as_tracer(-1, &status, 0));
+        std::ofstream("/proc/sys/kernel/ns_last_pid") << pid - 1;
+        const pid_t stranger = fork();
+        if (stranger == 0) {
+            pause();
+            _exit(0);
+        }
+        if (stranger != pid)
+            GTEST_SKIP() << "this kernel does not give out a number that is asked for";
+        stop_probes(&probes);
+        kill(stranger, SIGKILL);
+        ASSERT_EQ(stranger, waitpid(stranger, &status, 0));
+        EXPECT_EQ(SIGKILL, WTERMSIG(status)) << "and not SIGTERM";
     });
 }
 
