@@ -162,6 +162,9 @@ int snapshot_process(TarWriter *tw, int fd, pid_t *pids, int i, int count) {
         length = control_line_core_length(line);
         drop_covered(line, pids, i, count);
     }
+    // One that no header can announce would be lost together with all that is behind it.
+    if (length > TAR_SIZE_LIMIT)
+        length = 0;
 
     int result = 0;
     if (length > 0) {

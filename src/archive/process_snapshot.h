@@ -24,5 +24,5 @@ int snapshot_process(TarWriter *tw, int fd, pid_t *pids, int i, int count);
 // Writes the core image of process `pid` to `out_fd`. Returns 0, whatever came of it.
 int dump_core_to_fd(int out_fd, pid_t pid);
 
-// Adds a long listing of the descriptors of `pid` as member `name`.
+// Adds a long listing of the descriptors of `pid`, or what /bin/ls complains of, as member `name`.
 void add_fdmap(TarWriter *tw, const char *name, pid_t pid, int fd);

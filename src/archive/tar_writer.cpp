@@ -65,8 +65,9 @@ void fill_header(TarHeader *header, const TarWriter *tw, const char *name, int64
     put(header->uid, "0000100");
     put(header->gid, "0000100");
     (void)snprintf(header->size, sizeof header->size, "%11.11" PRIo64, size);
-    (void)snprintf(header->mtime, sizeof header->mtime, "%11.11" PRIo64,
-                   static_cast<int64_t>(time(nullptr)));
+    // Unsigned, so that a clock of 32 bits serves until 2106.
+    (void)snprintf(header->mtime, sizeof header->mtime, "%11.11" PRIo32,
+                   static_cast<uint32_t>(time(nullptr)));
     header->typeflag = '0';
     // The magic of POSIX with the version of old GNU tar: all readers take it, and archives of this
     // kind have always carried it.

@@ -4,6 +4,9 @@
 
 #include <stdint.h>
 
+// The largest size that a header can announce: eleven octal digits.
+constexpr int64_t TAR_SIZE_LIMIT = 077777777777;
+
 // One archive being written. A member's size is announced by its header; whoever adds the member
 // writes that much data behind it, through tar_write, or straight to the descriptor with
 // tar_account. (The few members that may come out otherwise say so where they are made.)
@@ -24,7 +27,8 @@ void tar_close(TarWriter *tw);
 // Frees the writer of an archive whose output is broken: nothing more is written.
 void tar_abandon(TarWriter *tw);
 
-// Pads the previous member and writes the header of member `name` with `size` bytes of data. A name
+// Pads the previous member and writes the header of member `name` with `size` bytes of data, from 0
+// to TAR_SIZE_LIMIT. A name
 // that does not fit the header's 100 bytes together with the prefix is cut. Write errors are not
 // told; they show in the data that follows.
 void tar_header(TarWriter *tw, const char *name, int64_t size);

@@ -1,6 +1,7 @@
 #include "archive/process_snapshot.h"
 
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
 
@@ -218,6 +219,38 @@ TEST_F(Snapshot, EndsTheLoopWhenTheArchivesReaderHasGone) {
     EXPECT_EQ("ABORT!\n", testing::internal::GetCapturedStderr());
     EXPECT_EQ(std::to_string(getpid()) + "\n", read_whole_file(archive_.dir / "calls"));
     tar_close(archive_.tw);
+}
+
+TEST_F(Snapshot, EndsTheLoopWhenTheArchivesReaderGoesAwayInTheMidstOfACore) {
+    signal(SIGPIPE, SIG_IGN);
+    int ends[2];
+    ASSERT_EQ(0, pipe2(ends, O_CLOEXEC));
+    const pid_t reader = fork();
+    if (reader == 0) {
+        char bytes[1000];
+        close(ends[1]);
+        for (int i = 0; i < 200; ++i)
+            (void)!read(ends[0], bytes, sizeof bytes);
+        _exit(0);
+    }
+    close(ends[0]);
+    const UniqueFd out(ends[1]);
+    TarWriter *tw = tar_open(out.get(), nullptr);
+    script("echo $3 >>" + archive_.dir / "calls" + "; control 1000000; head -c 1000000 /dev/zero");
+    pid_t pids[] = {getpid(), getppid()};
+    testing::internal::CaptureStderr();
+    snapshot_processes(tw, out.get(), pids, 2);
+    EXPECT_EQ("ABORT!\n", testing::internal::GetCapturedStderr());
+    EXPECT_EQ(std::to_string(getpid()) + "\n", read_whole_file(archive_.dir / "calls"));
+    tar_abandon(tw);
+    tar_close(archive_.tw);
+    waitpid(reader, nullptr, 0);
+}
+
+TEST_F(Snapshot, HasNoCoreOfALengthThatNoHeaderCanAnnounce) {
+    script("control 8589934592 $3; printf abc");
+    EXPECT_EQ(0, take({getpid()}));
+    EXPECT_EQ(0u, archive_.close().size());
 }
 
 TEST_F(Snapshot, ReportsABrokenOutputAsEpipe) {
