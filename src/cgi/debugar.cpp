@@ -15,6 +15,7 @@
 #include "archive/write_archive.h"
 #include "cgi/service_loop.h"
 #include "cgi/settings.h"
+#include "formvars.h"
 #include "proc/process_table.h"
 #include "sockhand.h"
 #include "util/standard_streams.h"
@@ -61,7 +62,7 @@ int open_segf_socket(const char *path) {
     sockaddr_un address = {};
     address.sun_family = AF_UNIX;
     if (strlen(path) > sizeof address.sun_path)
-        abort();  // a mistake in how the service was set up, to be seen at once
+        abort();  // a mistake in how the service was set up
     memcpy(address.sun_path, path, strlen(path));
     if (bind(segf_socket.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address) !=
         0) {
@@ -72,7 +73,16 @@ int open_segf_socket(const char *path) {
     return segf_socket.release();
 }
 
+// Ends the service if its libraries are broken: better at the start, where somebody looks, than at
+// the first request.
+void try_form_variables() {
+    CGI_set_query("");
+    CGI_save_env();
+    CGI_cleanup();
+}
+
 int serve() {
+    try_form_variables();
     if (!settings.no_daemon && daemon(0, 0) != 0) {
         perror("daemon\n");
         return 1;

@@ -92,9 +92,14 @@ TEST(Dispatcher, IgnoresABrokenPipeInEveryApplet) {
         rlimit tight = {40, 40};
         setrlimit(RLIMIT_NOFILE, &tight);
     };
-    const std::vector<std::string> applets[] = {
-        {"ctest"},   {"fdleak"},           {"pcapdump"}, {"tstrace"}, {"tstrace", "/bin/true"},
-        {"stopper"}, {"debugar.cgi", "-h"}};
+    const std::vector<std::string> applets[] = {{"ctest"},
+                                                {"fdleak"},
+                                                {"pcapdump"},
+                                                {"tstrace"},
+                                                {"tstrace", "/bin/true"},
+                                                {"stopper"},
+                                                {"debugar.cgi", "-h"},
+                                                {"oopslog"}};
     for (const std::vector<std::string> &applet : applets)
         EXPECT_EQ(0, run_fieldkit(applet, options).signal) << applet[0];
     close(ends[1]);
@@ -248,9 +253,9 @@ std::string copy_executable(const TempDir &dir) {
     return dir / "sbin/debugar.cgi";
 }
 
-// Makes the dynamic linker find something else where it looks first.
-RunOptions with_broken_sockhand(const TempDir &dir) {
-    dir.file("broken/libsockhand.so", "no library");
+// Makes the dynamic linker find something else than `library` where it looks first.
+RunOptions with_broken(const std::string &library, const TempDir &dir) {
+    dir.file("broken/" + library, "no library");
     RunOptions options;
     options.env = {"LD_LIBRARY_PATH=" + dir / "broken"};
     return options;
@@ -272,7 +277,7 @@ TEST(Libraries, ThatAreBrokenEndTheAppletThatNeedsThem) {
     run_in_sandbox([] {
         const TempDir dir;
         const std::string program = copy_executable(dir);
-        const RunOptions options = with_broken_sockhand(dir);
+        const RunOptions options = with_broken("libsockhand.so", dir);
         const RunResult service =
             run_program({program, "-n", "-c", dir / "cgi", "-s", dir / "segf"}, options);
         EXPECT_EQ(127, service.exit_status);
@@ -282,11 +287,23 @@ TEST(Libraries, ThatAreBrokenEndTheAppletThatNeedsThem) {
     });
 }
 
+TEST(Libraries, ThatAreBrokenAreToldOfByTheServiceBeforeItDetaches) {
+    run_in_sandbox([] {
+        const TempDir dir;
+        const std::string program = copy_executable(dir);
+        const RunResult service = run_program({program, "-c", dir / "cgi", "-s", dir / "segf"},
+                                              with_broken("libformvars.so", dir));
+        EXPECT_EQ(127, service.exit_status);
+        EXPECT_NE(std::string::npos, service.err.find("broken/libformvars.so")) << service.err;
+        EXPECT_NE(0, access((dir / "cgi").c_str(), F_OK));
+    });
+}
+
 TEST(Libraries, AreTakenFromBesideTheExecutableWhereTheUsualOnesCannotBeOpened) {
     run_in_sandbox([] {
         const TempDir dir;
         const std::string program = copy_executable(dir);
-        const RunOptions options = with_broken_sockhand(dir);
+        const RunOptions options = with_broken("libsockhand.so", dir);
         dir.file(LIBRARY_FOLDER "/libsockhand.so", read_whole_file(path_of_sockhand()), 0755);
         const Background service({program, "-n", "-c", dir / "cgi", "-s", dir / "segf"}, options);
         EXPECT_TRUE(wait_until([&] { return access((dir / "segf").c_str(), F_OK) == 0; }));
