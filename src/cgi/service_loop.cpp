@@ -1,13 +1,11 @@
 #include "cgi/service_loop.h"
 
 #include <errno.h>
+#include <poll.h>
 #include <pthread.h>
 #include <stdio.h>
-#include <sys/select.h>
 #include <sys/socket.h>
 #include <unistd.h>
-
-#include <algorithm>
 
 #include "cgi/client_connection.h"
 #include "cgi/dispatch.h"
@@ -67,19 +65,19 @@ int service_loop(int cgi_socket, int segf_socket, const char *dump_dir) {
     // next start of the service.
     bool spool_drained = false;
     for (;;) {
-        fd_set readable;
-        FD_ZERO(&readable);
-        FD_SET(cgi_socket, &readable);
-        FD_SET(segf_socket, &readable);
-        int ready =
-            select(std::max(cgi_socket, segf_socket) + 1, &readable, nullptr, nullptr, nullptr);
+        pollfd sockets[] = {{.fd = cgi_socket, .events = POLLIN, .revents = 0},
+                            {.fd = segf_socket, .events = POLLIN, .revents = 0}};
+        const auto &[requests, cores] = sockets;
+        int ready = poll(sockets, 2, -1);
+        // The message is older than the call. select() itself has no room for large descriptors,
+        // such as the service gets where it was started with a thousand open ones.
         if (ready == -1)
             perror("select");
         if (ready <= 0)
             continue;
-        if (FD_ISSET(cgi_socket, &readable) && !take_request(cgi_socket))
+        if (requests.revents != 0 && !take_request(cgi_socket))
             continue;
-        if (FD_ISSET(segf_socket, &readable)) {
+        if (cores.revents != 0) {
             take_core(segf_socket);
             continue;
         }

@@ -93,7 +93,7 @@ bool is_reply(const std::string &reply) {
 
 std::atomic<uint32_t> archive_busy = 0;
 
-bool start_worker(void *(*routine)(void *), void *argument) {
+bool start_worker(void *(*routine)(void *), void *argument, pthread_t *) {
     if (!threads_left)
         return false;
     const int client = take(routine, argument);

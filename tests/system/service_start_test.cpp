@@ -5,8 +5,10 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <string.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -16,6 +18,7 @@
 #include <vector>
 
 #include "support/process_state.h"
+#include "support/refused_calls.h"
 #include "support/replies.h"
 #include "support/run_program.h"
 #include "support/sandbox.h"
@@ -129,6 +132,51 @@ TEST(ServiceStart, SaysWhyItCannotDetach) {
         EXPECT_TRUE(wait_until([&] { return std::filesystem::file_size(log) > 0; }));
         EXPECT_EQ("daemon\n: No such device\n", read_whole_file(log));
         EXPECT_FALSE(std::filesystem::exists(dir / "cgi"));
+    });
+}
+
+#if !defined(__SANITIZE_THREAD__)  // whose run-time library has a thread of its own
+// No process or thread can be started any more.
+void refuse_clones() {
+    (void)refuse_call(SYS_clone, EAGAIN);
+    (void)refuse_call(SYS_clone3, EAGAIN);
+}
+
+TEST(ServiceStart, SaysWhyItCannotFork) {
+    if (!can_refuse_calls())
+        GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
+    TempDir dir;
+    const RunResult result = run_fieldkit({"debugar.cgi", "-c", dir / "cgi", "-s", dir / "segf"},
+                                          {.before_exec = refuse_clones});
+    EXPECT_EQ(1, result.exit_status);
+    EXPECT_EQ("daemon\n: Resource temporarily unavailable\n", result.err);
+}
+
+TEST(ServiceStart, EndsWhenItCannotHaveItsMonitor) {
+    if (!can_refuse_calls())
+        GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
+    TempDir dir;
+    const RunResult result =
+        run_fieldkit({"debugar.cgi", "-n", "-c", dir / "cgi", "-s", dir / "segf"},
+                     {.before_exec = refuse_clones});
+    EXPECT_EQ(1, result.exit_status);
+    EXPECT_EQ("pthread_create: Resource temporarily unavailable\n", result.err);
+}
+#endif
+
+TEST(ServiceStart, WorksAlsoWithAThousandDescriptorsThatItWasLeft) {
+    run_in_sandbox([] {
+        ServiceOptions options;
+        options.run.before_exec = [] {
+            const rlimit room = {2000, 2000};
+            setrlimit(RLIMIT_NOFILE, &room);
+            while (open("/dev/null", O_RDONLY) < 1100) {
+            }
+        };
+        Service service(options);
+        EXPECT_EQ(BAD_REQUEST, service.reply("/x", "cmd=pcap"));
+        const Client listener = service.request("/x", "listen");
+        EXPECT_TRUE(listener.is_waiting());
     });
 }
 

@@ -74,7 +74,7 @@ bool start_watcher(StraceRequest *req, pthread_t *watcher) {
     (void)sigemptyset(&wake_up);
     (void)sigaddset(&wake_up, SIGUSR1);
     (void)pthread_sigmask(SIG_BLOCK, &wake_up, &before);  // the new thread's mask
-    bool started = pthread_create(watcher, nullptr, run_strace_watcher, req) == 0;
+    bool started = start_worker(run_strace_watcher, req, watcher);
     (void)pthread_sigmask(SIG_SETMASK, &before, nullptr);
     return started;
 }

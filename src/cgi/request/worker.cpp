@@ -1,7 +1,5 @@
 #include "cgi/request/worker.h"
 
-#include <pthread.h>
-
 #include "cgi/http_reply.h"
 
 namespace {
@@ -12,13 +10,14 @@ constexpr size_t STACK_SIZE = 512 * 1024;
 
 }  // namespace
 
-bool start_worker(void *(*routine)(void *), void *argument) {
+bool start_worker(void *(*routine)(void *), void *argument, pthread_t *thread) {
     pthread_attr_t attributes;
     if (pthread_attr_init(&attributes) != 0)
         return false;
     (void)pthread_attr_setstacksize(&attributes, STACK_SIZE);
-    pthread_t thread;
-    bool started = pthread_create(&thread, &attributes, routine, argument) == 0;
+    pthread_t unnamed;
+    pthread_t *started_thread = thread != nullptr ? thread : &unnamed;
+    bool started = pthread_create(started_thread, &attributes, routine, argument) == 0;
     (void)pthread_attr_destroy(&attributes);
     return started;
 }

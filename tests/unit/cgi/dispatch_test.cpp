@@ -35,7 +35,7 @@ bool threads_left = true;
 
 }  // namespace
 
-bool start_worker(void *(*routine)(void *), void *argument) {
+bool start_worker(void *(*routine)(void *), void *argument, pthread_t *) {
     if (!threads_left)
         return false;
     started = {routine, argument};
