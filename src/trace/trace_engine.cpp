@@ -26,6 +26,7 @@ constexpr uint32_t DEFAULT_BUF_SIZE = 4096;
 constexpr uint32_t IN_SYSCALL = 1;            // the bit of TracedProcess::in_syscall
 constexpr int SYSCALL_STOP = SIGTRAP | 0x80;  // as PTRACE_O_TRACESYSGOOD marks it
 constexpr long HELD_POLL_MS = 50;
+constexpr long LOCK_POLL_MS = 200;
 constexpr unsigned LOOK_EVENTS = 64;
 constexpr int LOOK_PROCESSES = 8;
 
@@ -45,8 +46,7 @@ struct Trace {
 };
 
 // Whether the caller wants the trace to go on.
-bool wanted(const Trace &trace) {
-    const TraceRequest &request = *trace.request;
+bool wanted(const TraceRequest &request) {
     return request.output_cb == nullptr || request.output_cb(request.cookie, request.buf, 0) != 0;
 }
 
@@ -74,6 +74,27 @@ bool step(Trace *trace, int index, int sig) {
 }
 
 // ---- Set-up ----
+
+// False when another trace has the lock for LOCK_POLL_MS.
+bool try_lock() {
+    timespec end;
+    (void)clock_gettime(CLOCK_REALTIME, &end);
+    end.tv_nsec += LOCK_POLL_MS * 1000000;
+    if (end.tv_nsec >= 1000000000) {
+        end.tv_nsec -= 1000000000;
+        ++end.tv_sec;
+    }
+    return pthread_mutex_timedlock(&trace_mutex, &end) == 0;
+}
+
+// Waits for other traces to end. False when this one is not wanted any more before they have.
+bool lock_engine(const TraceRequest &request) {
+    while (!try_lock()) {
+        if (!wanted(request))
+            return false;
+    }
+    return true;
+}
 
 bool provide_buffer(TraceRequest *request) {
     if (request->buf != nullptr && request->buf_size != 0)
@@ -309,10 +330,10 @@ void follow(Trace *trace) {
         bool expired = trace->timer != -1 && pid == trace->timer;
         if (expired)
             trace->timer = -1;
-        if (!wanted(*trace) || expired)
+        if (!wanted(*trace->request) || expired)
             return;
         if (pid == -1) {
-            if (error == ECHILD || (error == EINTR && !wanted(*trace)))
+            if (error == ECHILD || (error == EINTR && !wanted(*trace->request)))
                 return;
             continue;
         }
@@ -394,8 +415,7 @@ void trace_run(TraceRequest *request) {
     // One more than there are processes: an empty table is not a failed allocation.
     UniqueBlock<TracedProcess> records(static_cast<TracedProcess *>(
         calloc(static_cast<size_t>(request->nr_pids) + 1, sizeof(TracedProcess))));
-    if (records != nullptr) {
-        (void)pthread_mutex_lock(&trace_mutex);
+    if (records != nullptr && lock_engine(*request)) {
         request->records = records.get();
         if (provide_buffer(request))
             run(request);

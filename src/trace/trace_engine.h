@@ -9,7 +9,8 @@
 // the traced processes are not followed.
 //
 // A process that cannot be attached is dropped (its entry becomes -1). Text reaches the caller
-// through output_cb only, which is also asked after every wait whether to go on; the tracer's own
-// complaints go to standard output. While it runs, every child of the calling process may be reaped
-// by it; wait_for_child in other threads gets the status all the same. Frees request->buf.
+// through output_cb only, which is also asked after every wait, and now and then while another
+// trace runs, whether to go on; the tracer's own complaints go to standard output. While it runs,
+// every child of the calling process may be reaped by it; wait_for_child in other threads gets the
+// status all the same. Frees request->buf.
 void trace_run(TraceRequest *request);

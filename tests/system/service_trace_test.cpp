@@ -103,6 +103,25 @@ TEST(ServiceTraces, ClosingTheBrowserEndsTheTraceOfAQuietProcess) {
     });
 }
 
+// Once there has been a trace, its wake-up signal does nothing but end the wait of whoever gets it.
+TEST(ServiceTraces, ASignalToTheServiceAfterATraceIsToldAndChangesNothing) {
+    run_in_sandbox([] {
+        const TempDir dir;
+        const std::string errors = dir.file("errors", "");
+        ServiceOptions options;
+        options.run.before_exec = [&] { dup2(open(errors.c_str(), O_WRONLY), STDERR_FILENO); };
+        Service service(options);
+        Sleeper process;
+        start_trace(service, process).close();
+        expect_end_of_trace(service, process);
+        service.process().send_signal(SIGUSR1);
+        const std::string message = "select: Interrupted system call\n";
+        EXPECT_TRUE(wait_until([&] { return read_whole_file(errors) == message; }))
+            << read_whole_file(errors);
+        EXPECT_EQ(BAD_REQUEST, service.reply("/x", "cmd=pcap"));
+    });
+}
+
 TEST(ServiceTraces, ABrowserThatSaysAnythingEndsTheTraceToo) {
     run_in_sandbox([] {
         Service service;
@@ -207,13 +226,16 @@ TEST(ServiceTraces, TracesComeOneAfterAnother) {
         Service service;
         Sleeper process;
         Client first = start_trace(service, process);
-        // The others have their headers, and wait for the end of the first, even to end themselves.
+        const int threads = service.threads();
+        // The others have their headers, and wait for the end of the first.
         Client second = service.request("/x", trace_query(process.pid()));
         Client third = service.request("/x", trace_query(process.pid()));
         EXPECT_EQ(trace_header(), second.read_until_text("\r\n\r\n"));
         EXPECT_EQ(trace_header(), third.read_until_text("\r\n\r\n"));
-        second.close();
+        // Whoever leaves is not waited for.
         third.close();
+        second.close();
+        EXPECT_TRUE(wait_until([&] { return service.threads() == threads; }));
         EXPECT_TRUE(is_traced(process.pid()));
         first.close();
         expect_end_of_trace(service, process);

@@ -420,17 +420,19 @@ std::atomic<int> traces_called, traces_active;
 std::atomic<bool> overlapped;
 
 struct OwnTrace {
-    int polls_left;
+    int lines_left;
     bool active;
 };
 
-uint32_t watch_for_overlap(intptr_t cookie, const char *, uint32_t) {
+uint32_t watch_for_overlap(intptr_t cookie, const char *, uint32_t len) {
     OwnTrace *own = reinterpret_cast<OwnTrace *>(cookie);
+    if (len == 0 && !own->active)
+        return 1;  // it may still have to wait
     if (!own->active && traces_active.fetch_add(1) != 0)
         overlapped = true;
     own->active = true;
     // Long enough for the other one to begin as well, if it could.
-    if (traces_called < 2 || --own->polls_left > 0)
+    if (traces_called < 2 || --own->lines_left > 0)
         return 1;
     traces_active.fetch_sub(1);
     return 0;
@@ -439,10 +441,11 @@ uint32_t watch_for_overlap(intptr_t cookie, const char *, uint32_t) {
 TEST_F(TraceRun, WaitsForATraceOfAnotherThreadToEnd) {
     Child first(call_for_ever), second(call_for_ever);
     auto trace = [](pid_t pid) {
-        OwnTrace own = {.polls_left = 2000, .active = false};
+        OwnTrace own = {.lines_left = 2000, .active = false};
         TraceRequest request = {};
         request.output_cb = watch_for_overlap;
         request.cookie = reinterpret_cast<intptr_t>(&own);
+        request.flags = TRACE_SYSCALLS;
         request.pids = &pid;
         request.nr_pids = 1;
         ++traces_called;
@@ -455,6 +458,31 @@ TEST_F(TraceRun, WaitsForATraceOfAnotherThreadToEnd) {
     EXPECT_EQ(traces_active, 0);
     EXPECT_TRUE(runs_free(first.pid()));
     EXPECT_TRUE(runs_free(second.pid()));
+}
+
+TEST_F(TraceRun, DoesNotWaitForAnotherOneToEndWhenItIsNotWantedAnyMore) {
+    Child traced(call_for_ever), other(call_for_ever);
+    auto trace = [](TraceLog *log, pid_t pid) {
+        std::vector<pid_t> pids = {pid};
+        TraceRequest request = request_for(log, &pids);
+        trace_run(&request);
+    };
+    std::atomic<bool> under_way = false, ended = false;
+    TraceLog first;
+    first.end_when = [&] {
+        under_way = true;
+        return ended.load();
+    };
+    std::thread thread([&] { trace(&first, traced.pid()); });
+    EXPECT_TRUE(wait_until([&] { return under_way.load(); }));
+    TraceLog second;
+    second.polls_wanted = 1;
+    trace(&second, other.pid());
+    EXPECT_EQ(1, second.polls);
+    EXPECT_FALSE(ended);
+    ended = true;
+    thread.join();
+    EXPECT_TRUE(runs_free(other.pid()));
 }
 
 }  // namespace
