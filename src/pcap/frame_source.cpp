@@ -36,7 +36,9 @@ static_assert(SLOT_SIZE % TPACKET_ALIGNMENT == 0);
 constexpr uint32_t BLOCK_SIZE = 65536;
 constexpr uint32_t SLOTS_PER_BLOCK = BLOCK_SIZE / SLOT_SIZE;
 
-// The ring cannot be swapped out, so a small device gets a small one.
+// A ring cannot be swapped out, so a small device gets a small one, and no more than some at a
+// time: how many captures there are is up to the service's clients.
+constexpr int MOST_RINGS = 4;
 constexpr uint32_t MOST_BLOCKS = 4194304 / BLOCK_SIZE;
 constexpr uint32_t FEWEST_BLOCKS = 262144 / BLOCK_SIZE;
 constexpr uint32_t RING_SHARE_OF_MEMORY = 64;
@@ -48,6 +50,8 @@ constexpr int SOCKET_BUFFER_SIZE = 2097152;
 constexpr uint32_t PREFETCH_AHEAD = 4;
 constexpr uint32_t PREFETCHED_BYTES = 192;
 constexpr uint32_t CACHE_LINE = 64;
+
+std::atomic<int> open_rings;
 
 int report_failure(const char *what) {
     const int error = errno;
@@ -75,31 +79,39 @@ bool set_ring(int socket_fd, uint32_t blocks) {
 }  // namespace
 
 FrameRing::~FrameRing() {
-    if (blocks_ != nullptr)
-        (void)munmap(blocks_, size_t{block_count_} * BLOCK_SIZE);
+    if (blocks_ == nullptr)
+        return;
+    (void)munmap(blocks_, size_t{block_count_} * BLOCK_SIZE);
+    --open_rings;
 }
 
 void FrameRing::open(int socket_fd) {
+    if (++open_rings > MOST_RINGS || !map(socket_fd))
+        --open_rings;
+}
+
+bool FrameRing::map(int socket_fd) {
     int version = RING_VERSION;
     if (setsockopt(socket_fd, SOL_PACKET, PACKET_VERSION, &version, sizeof version) < 0)
-        return;
+        return false;
     uint32_t blocks = wanted_blocks();
     while (!set_ring(socket_fd, blocks)) {
         blocks /= 2;
         if (blocks < FEWEST_BLOCKS)
-            return;
+            return false;
     }
     const size_t size = size_t{blocks} * BLOCK_SIZE;
     void *mapped = mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, socket_fd, 0);
     if (mapped == MAP_FAILED) {
         // With a ring that nobody can look at, no frame would ever be seen.
         (void)set_ring(socket_fd, 0);
-        return;
+        return false;
     }
     // A child would keep the socket, and with it the capture, alive.
     (void)madvise(mapped, size, MADV_DONTFORK);
     blocks_ = static_cast<uint8_t *>(mapped);
     block_count_ = blocks;
+    return true;
 }
 
 uint32_t FrameRing::slots() const {

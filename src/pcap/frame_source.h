@@ -26,8 +26,9 @@ class FrameRing {
     FrameRing &operator=(const FrameRing &) = delete;
     ~FrameRing();
 
-    // Makes `socket_fd` put its frames into a ring, if the kernel can do that and has the memory.
-    // To be called before the socket is bound: what it has queued by then is lost.
+    // Makes `socket_fd` put its frames into a ring, if the kernel can do that and has the memory,
+    // and unless this process has several already. To be called before the socket is bound: what it
+    // has queued by then is lost.
     void open(int socket_fd);
     bool valid() const { return blocks_ != nullptr; }
     // How many frames it holds.
@@ -37,6 +38,8 @@ class FrameRing {
     Taken take(uint8_t *to, uint32_t size, uint32_t *length);
 
   private:
+    bool map(int socket_fd);
+
     uint8_t *blocks_ = nullptr;
     uint32_t block_count_ = 0;
     uint32_t block_ = 0;  // where the next frame will be
