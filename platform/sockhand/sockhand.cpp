@@ -125,9 +125,15 @@ bool watch(const Server *server, int fd, int slot) {
     return epoll_ctl(server->epoll_fd, EPOLL_CTL_ADD, fd, &event) == 0;
 }
 
-// Closing takes it out of the epoll set as well.
-void drop_connection(Connection *connection) {
-    close_quietly(connection->fd);
+// To close it would take it out of the epoll set as well, but not as long as a child that has just
+// been forked has a copy.
+void drop_connection(const Server *server, Connection *connection) {
+    if (connection->fd < 0)
+        return;
+    const int saved_errno = errno;
+    (void)epoll_ctl(server->epoll_fd, EPOLL_CTL_DEL, connection->fd, nullptr);
+    (void)close(connection->fd);
+    errno = saved_errno;
     connection->fd = -1;
 }
 
@@ -151,14 +157,14 @@ int open_reserve() {
     return open("/dev/null", O_RDONLY | O_CLOEXEC);
 }
 
-// Accepts when no descriptor is left. Those who only wait must not keep out those who have
-// something to say; and when nobody waits, the sender is turned away, since a caller that waits for
-// the listening socket would otherwise spin.
+// Accepts when no descriptor is left. Those who connected and have not sent anything by now must
+// not keep out those who may; and when nobody waits, the sender is turned away, since a caller that
+// waits for the listening socket would otherwise spin.
 int accept_without_descriptors(Server *server) {
     bool freed = false;
     for (Connection &connection : server->waiting) {
         freed = freed || connection.fd >= 0;
-        drop_connection(&connection);
+        drop_connection(server, &connection);
     }
     if (freed)
         return accept_nonblocking(server);
@@ -171,16 +177,25 @@ int accept_without_descriptors(Server *server) {
     return -1;
 }
 
+// Whether an accept that failed with `error` will fail again at once, and the listening socket stay
+// readable.
+bool is_shortage(int error) {
+    return error == ENOMEM || error == ENOBUFS;
+}
+
 // Accepts one connection. Returns its slot, or -1.
 int accept_connection(Server *server) {
     int fd = accept_nonblocking(server);
     if (fd < 0 && (errno == EMFILE || errno == ENFILE))
         fd = accept_without_descriptors(server);
-    if (fd < 0)
+    if (fd < 0) {
+        if (is_shortage(errno))
+            (void)usleep(SHORTAGE_PAUSE_US);
         return -1;
+    }
     const int slot = choose_slot(server);
     Connection *connection = &server->waiting[slot];
-    drop_connection(connection);
+    drop_connection(server, connection);
     if (!watch(server, fd, slot)) {
         close_quietly(fd);
         return -1;
@@ -291,12 +306,12 @@ int sockhand_recv(int sock, void *buf, int max, int *fd) {
         if (slot == MAX_WAITING)
             slot = accept_connection(server);
         if (slot < 0)
-            continue;
+            break;  // whoever else is there keeps the descriptor readable
         Connection *connection = &server->waiting[slot];
         const int length = receive_message(connection->fd, buf, max, fd);
         if (length < 0 && (errno == EAGAIN || errno == EWOULDBLOCK))
             continue;  // its message is still to come
-        drop_connection(connection);
+        drop_connection(server, connection);
         return length;
     }
     errno = EAGAIN;

@@ -18,12 +18,13 @@ int sockhand_server_socket(const char *path, int mode);
 
 // Takes one message from `sock`, a descriptor that sockhand_server_socket gave, into the `max`
 // bytes at `buf`. Returns its length, above 0, with the descriptor that came with it in `*fd`: the
-// caller's to close, close-on-exec. Never blocks.
+// caller's to close, close-on-exec. Does not wait for a sender; only when descriptors or memory are
+// short does it pause, for an instant.
 //
 // Returns -1 with -1 in `*fd` when there is none: the sender has only connected so far, left
 // without a word, sent no descriptor with its message, or sent more than `max` bytes. A further
-// descriptor in a message is closed. However a sender behaves, the others are served as if it were
-// not there.
+// descriptor in a message is closed. A sender that connects and sends nothing keeps nobody waiting,
+// and loses its connection when 32 newer ones do the same, or when descriptors are short.
 int sockhand_recv(int sock, void *buf, int max, int *fd);
 
 // Closes `sock` and everything behind it. The file at the socket's path stays.
