@@ -4,8 +4,11 @@
 #include <gtest/gtest.h>
 #include <pthread.h>
 #include <signal.h>
+#include <time.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <functional>
 #include <thread>
 
 #include "stream_pieces.h"
@@ -65,26 +68,49 @@ TEST(AwaitReader, LeavesItToTheWriteToTellThatTheReaderHasGone) {
     EXPECT_TRUE(await_reader(pipe.out.get(), 1, nullptr));
 }
 
+// Sends SIGUSR1, which does nothing but end waits, to the thread that made it, all the time.
+class Signaller {
+  public:
+    explicit Signaller(const std::function<void(int)> &before_each) {
+        struct sigaction action = {};
+        action.sa_handler = [](int) {};
+        EXPECT_EQ(0, sigaction(SIGUSR1, &action, nullptr));
+        thread_ = std::thread([this, before_each, waiter = pthread_self()] {
+            for (int i = 0; !ended_; ++i) {
+                before_each(i);
+                pthread_kill(waiter, SIGUSR1);
+                usleep(20000);
+            }
+        });
+    }
+    ~Signaller() {
+        ended_ = true;
+        thread_.join();
+    }
+    Signaller(const Signaller &) = delete;
+    Signaller &operator=(const Signaller &) = delete;
+
+  private:
+    std::atomic<bool> ended_ = false;
+    std::thread thread_;
+};
+
 TEST(AwaitReader, EndsAtASignalOnceNothingIsWantedAnyMore) {
-    struct sigaction action = {};
-    action.sa_handler = [](int) {};
-    ASSERT_EQ(0, sigaction(SIGUSR1, &action, nullptr));
     Pipe pipe;
     fill(pipe);
     std::atomic<uint32_t> wanted = 1;
-    std::atomic<bool> ended = false;
-    const pthread_t waiter = pthread_self();
-    std::thread signaller([&] {
-        for (int i = 0; !ended; ++i) {
-            wanted = i < 10;
-            pthread_kill(waiter, SIGUSR1);
-            usleep(20000);
-        }
-    });
+    const Signaller signaller([&](int i) { wanted = i < 10; });
     EXPECT_FALSE(await_reader(pipe.out.get(), LONG, &wanted));
     EXPECT_EQ(0u, wanted);
-    ended = true;
-    signaller.join();
+}
+
+TEST(AwaitReader, LosesNoPatienceThroughSignals) {
+    Pipe pipe;
+    fill(pipe);
+    const Signaller signaller([](int) {});
+    const time_t begin = time(nullptr);
+    EXPECT_FALSE(await_reader(pipe.out.get(), 2, nullptr));
+    EXPECT_LE(begin + 2, time(nullptr));
 }
 
 }  // namespace
