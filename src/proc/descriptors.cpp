@@ -87,7 +87,7 @@ void forget_last_process() {
     last_pid = -1;
     (void)pthread_mutex_unlock(&last_lock);
     close_diag();
-    ask_about_sockets_again();
+    forget_sockets();
 }
 
 int list_fds(pid_t pid, int *fds, int max) {

@@ -14,8 +14,8 @@ constexpr size_t SLOTS = 256;  // by inode: a newer socket takes an older one's 
 constexpr size_t NAME_SIZE = sizeof(sockaddr_un::sun_path);
 constexpr size_t TEXT_SIZE = NAME_SIZE + 3;
 
-// As many questions in a row without an answer, and the kernel is taken to have none: also to ask
-// costs time.
+// As many questions about known sockets in a row without an answer, and the kernel is taken to have
+// none: also to ask costs time.
 constexpr int MAX_SILENCE = 8;
 
 enum class Kind : uint8_t { NONE, TCP, UNIX };
@@ -109,7 +109,9 @@ bool sockets_can_be_known() {
     return silence < MAX_SILENCE;
 }
 
-void ask_about_sockets_again() {
+void forget_sockets() {
     Lock guard;
     silence = 0;
+    for (KnownSocket &socket : known)
+        socket.kind = Kind::NONE;
 }

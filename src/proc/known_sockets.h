@@ -14,13 +14,15 @@
 int describe_known_socket(unsigned long inode, char *buf, size_t size);
 
 // Remember that `inode` was found with these ends, or in the table of Unix sockets with this text:
-// `name` of `name_length` bytes is what the kernel called it just before.
+// `name` of `name_length` bytes is what the kernel called it just before. One that it did not name
+// (-1) is not remembered.
 void remember_tcp_socket(unsigned long inode, const TcpSocket &socket);
 void remember_unix_socket(unsigned long inode, const char *name, int name_length, const char *text);
 
 // Whether the kernel answers; no more sockets need to be remembered otherwise.
 bool sockets_can_be_known();
 
-// Has the kernel asked again after all: connections that ended one after the other are answered as
-// little as anything is by a kernel that never does.
-void ask_about_sockets_again();
+// Remembers no socket any more, and has the kernel asked again even if it did not seem to answer:
+// connections that ended one after the other are answered as little as anything is by a kernel that
+// never does.
+void forget_sockets();
