@@ -39,10 +39,11 @@ memory() {
 # Only local file systems: asking a server that has gone would keep the report waiting.
 # Some builds of busybox run their own df for a bare name, whatever is in PATH.
 disks() {
-    awk '$1 !~ /:/ && $1 !~ /^\/\// && $3 !~ /^(nfs|cifs|smb|autofs|fuse)/ {
+    awk '$1 !~ /:/ && $1 !~ /^\/\// && $3 !~ /^(nfs|cifs|smb|autofs|fuse($|\.))/ {
         gsub(/\\040/, " ", $2)  # as the kernel writes a blank
-        print "\"" $2 "\""
-    }' /proc/mounts | sort -u | xargs -r "$(command -v df)" -k | awk 'NR == 1 || $2 != 0'
+        print $2
+    }' /proc/mounts | sort -u | tr '\n' '\0' | xargs -0 -r "$(command -v df)" -k |
+        awk 'NR == 1 || $2 != 0'
 }
 
 interfaces() {

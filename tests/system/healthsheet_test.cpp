@@ -152,16 +152,18 @@ TEST(HealthSheet, AsksNoServerForItsFileSystems) {
 }
 
 // The kernel writes a blank as \040.
-TEST(HealthSheet, AsksForMountPointsWithBlanks) {
+TEST(HealthSheet, AsksForMountPointsWithBlanksAndQuotes) {
     run_in_sandbox([] {
         TempDir dir;
         dir.file("proc/mounts",
                  "/dev/sda1 /media/My\\040USB\\040Stick vfat rw 0 0\n"
+                 "/dev/sdb1 /media/the\\0402\"\\040one's fuseblk rw 0 0\n"
                  "/dev/root / ext4 rw 0 0\n");
         sandbox_bind(dir.file("df", "#!/bin/sh\nprintf '<%s>' \"$@\"\n", 0755),
                      "/usr/local/sbin/df");
         sandbox_bind(dir / "proc", "/proc");
-        EXPECT_EQ("<-k></></media/My USB Stick>\n", section(run_report({script()}).out, "disks"));
+        EXPECT_EQ("<-k></></media/My USB Stick></media/the 2\" one's>\n",
+                  section(run_report({script()}).out, "disks"));
     });
 }
 
