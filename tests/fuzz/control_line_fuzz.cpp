@@ -14,7 +14,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     // As the caller reads it: a terminated text of limited length, here in a block of its own size,
     // so that the sanitizer sees a byte too many.
     std::string text(reinterpret_cast<const char *>(data + 1), size - 1);
-    text = text.substr(0, CONTROL_LINE_SIZE - 1).c_str();
+    text = text.substr(0, CONTROL_LINE_SIZE).c_str();
     const std::vector<char> line(text.c_str(), text.c_str() + text.size() + 1);
 
     (void)control_line_core_length(line.data());

@@ -117,7 +117,7 @@ TEST(Archive, InItsGzipFormHoldsTheSameMembersWithoutTheCompressor) {
         WITH_ETH0);
 }
 
-TEST(Archive, LosesOnlyTheMembersWhoseSourceIsMissing) {
+TEST(Archive, LosesFilesThatAreMissingAndSaysWhichProgramsAre) {
     run_in_sandbox(
         [] {
             sandbox_scratch("/usr/sbin");

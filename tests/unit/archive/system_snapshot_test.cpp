@@ -43,10 +43,12 @@ TEST(AddKcore, AddsTheKernelsMemoryOfUpToTenMebibytes) {
     });
 }
 
-TEST(AddKcore, AddsNothingWhenItIsLargerOrEmpty) {
+TEST(AddKcore, AddsNothingAndSaysNothingWhenItIsLargerOrEmpty) {
     run_in_sandbox([] {
+        testing::internal::CaptureStderr();
         EXPECT_EQ(-1, kcore_member(10485761));
         EXPECT_EQ(-1, kcore_member(0));
+        EXPECT_EQ("", testing::internal::GetCapturedStderr());
     });
 }
 

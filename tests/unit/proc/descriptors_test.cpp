@@ -135,6 +135,7 @@ TEST(DescribeFd, FollowsADescriptorThatBecomesAnother) {
 }
 
 TEST(DescribeFd, KeepsOneDescriptorForOneProcessAndNoneInTheEnd) {
+    forget_last_process();
     int fds[1024];
     int before = list_fds(getpid(), fds, 1024);
     (void)describe(0);

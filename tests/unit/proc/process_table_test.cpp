@@ -164,7 +164,7 @@ TEST(ProcName, OfAProcessStartedWithAPathIsItsLastComponentAndOfABareNameComesFr
 
 TEST(ProcName, DoesNotReadWhatTheBufferHeldBefore) {
     FakeProc proc;
-    proc.process(10, "app) (stale) x" + std::string(100, 'y'), "10 (app) S 1");
+    proc.process(10, std::string(20, 'a') + " (stale) x", "10 (app) S 1");
     EXPECT_EQ("app", proc.name(10, 256));
 }
 
