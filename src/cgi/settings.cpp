@@ -6,7 +6,7 @@
 
 namespace {
 
-// The "[pids...]" are not read, and "-k" is not told: the text is older than both.
+// Kept as it is known: the "[pids...]" are not read, and "-k" is not told.
 constexpr char USAGE[] =
     "dbg-cgi 0.1\n"
     "dbg-cgi [options] [pids...]\n"

@@ -31,6 +31,7 @@ bool find_newest_entry(const LogSource &source, NewestEntry *newest);
 // The page after `position` in a log of `size` bytes, round the ring.
 int64_t next_log_position(int64_t position, LogDirection direction, uint64_t size);
 
-// Prints every entry on `out`, beginning behind page `newest` so that its entry comes last. Write
-// errors are left in `out`.
+// Prints every entry on `out`, beginning behind page `newest` so that its entry comes last;
+// forwards in a log that ends with a part of a page that one is left out. Write errors are left in
+// `out`.
 void print_log(const LogSource &source, int64_t newest, LogDirection direction, FILE *out);

@@ -12,7 +12,7 @@ struct OopsDevice {
     uint64_t size;  // in bytes
 };
 
-// The size in bytes of a block device of so many sectors of 512 bytes, 2 TiB and more included
+// The size in bytes of a block device of so many sectors of 512 bytes, 4 GiB and more included
 // where a long has 32 bits.
 constexpr uint64_t block_device_size(unsigned long sectors) {
     return uint64_t{sectors} * 512;

@@ -280,8 +280,8 @@ int count_fds(pid_t pid, int *sockets, int *pipes) {
             break;
         }
         const int first = by_number ? count_numbers(dir.get(), &counts) : 0;
-        // Begun again, what had been counted so far stays and is counted once more: callers know
-        // the count of a busy table as one on the high side.
+        // A listing that is begun again keeps what had been counted so far, and counts it once
+        // more: callers know the count of a busy table as one on the high side.
         by_number = false;
         complete = first == ALL_COUNTED || count_entries(dir.get(), first, read_links, &counts);
     } while (!complete);

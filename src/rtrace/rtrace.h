@@ -10,8 +10,8 @@ struct Rtrace;
 Rtrace *rtrace_create(int fd, int32_t interval, uint32_t items);
 
 // Runs the trace until a write to its descriptor fails, the other end of that was closed where
-// nothing is written, memory is short, or the wait for the probe programs fails. Nothing is
-// printed. All probe programs have ended when it returns.
+// nothing is written, there is no memory to read a file into, or the wait for the probe programs
+// fails. Nothing is printed. All probe programs have ended when it returns.
 void rtrace_run(Rtrace *trace);
 
 // Releases `trace`, which may be null.

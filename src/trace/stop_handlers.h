@@ -7,9 +7,9 @@
 #include "trace/trace_request.h"
 
 // Handles the entry stop of `pid`: reads its registers into `regs` (kept for the exit stop), fills
-// `record` and writes a line with its newline into `buf` of `size` bytes. Returns the length of the
-// whole line, which may be more than fitted, or -1 when the registers cannot be read or the call's
-// number is out of range.
+// `record` and writes a line into `buf` of `size` bytes, with its newline if that fits as well.
+// Returns the length of the whole line, which may be more than fitted, or -1 when the registers
+// cannot be read or the call's number is out of range.
 int syscall_entry_stop(TraceRequest *request, pid_t pid, SyscallRecord *record, char *buf,
                        size_t size, TraceRegisters *regs);
 

@@ -13,7 +13,7 @@ namespace {
 
 constexpr uint32_t COPY_BLOCK = 16384;  // what is dropped of where an error was
 
-constexpr uint32_t READ_SIZE = 4 * COPY_BLOCK;  // the whole of a full pipe
+constexpr uint32_t READ_SIZE = 4 * COPY_BLOCK;  // the whole of a full pipe, with pages of 4 KiB
 
 // At once and without end, a full non-blocking descriptor included: the toolbox writes to blocking
 // ones, and giving up would cut its output.
