@@ -180,7 +180,8 @@ void connect_tcp(const std::string &listen_on, const std::string &connect_to, Tc
     socklen_t size = sizeof at;
     ASSERT_EQ(0, getsockname(listener, reinterpret_cast<sockaddr *>(&at), &size));
     sockaddr_storage to = address(connect_to, port_of(at));
-    ret->client = socket(to.ss_family, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    if (ret->client < 0)
+        ret->client = socket(to.ss_family, SOCK_STREAM | SOCK_CLOEXEC, 0);
     ASSERT_EQ(0, connect(ret->client, reinterpret_cast<sockaddr *>(&to), sizeof to))
         << strerror(errno);
     ret->server = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);

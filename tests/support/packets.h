@@ -63,6 +63,7 @@ struct TcpConnection {
     void close_client();
 };
 
-// Makes one over loopback, from a client that connects to the address `connect_to` to a server that
-// listens on `listen_on`. Skips the test where the machine has no such addresses.
+// Makes one from a client that connects to the address `connect_to` to a server that listens on
+// `listen_on`; the client is a new socket unless there is one already. Skips the test where the
+// machine has no such addresses.
 void connect_tcp(const std::string &listen_on, const std::string &connect_to, TcpConnection *ret);

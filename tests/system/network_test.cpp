@@ -4,7 +4,6 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
@@ -17,6 +16,7 @@
 #include <string>
 #include <vector>
 
+#include "support/far_network.h"
 #include "support/packets.h"
 #include "support/run_program.h"
 #include "support/sandbox.h"
@@ -167,42 +167,13 @@ void expect_own_connection_hidden(const Connection &own, const Connection &other
     EXPECT_LT(10, count_of_port(frames, own_port(other.near)));
 }
 
-// A network of its own with eth1 in it, which has the address `host`; a descriptor that stands for
-// it.
-int make_far_network(const std::string &host, const std::string &options) {
-    const int near = open("/proc/self/ns/net", O_RDONLY | O_CLOEXEC);
-    EXPECT_EQ(0, unshare(CLONE_NEWNET)) << strerror(errno);
-    const int far = open("/proc/self/ns/net", O_RDONLY | O_CLOEXEC);
-    EXPECT_EQ(0, setns(near, CLONE_NEWNET)) << strerror(errno);
-    // Known to `ip` by the process that lives in it.
-    const pid_t holder = fork();
-    if (holder == 0) {
-        setns(far, CLONE_NEWNET);
-        raise(SIGSTOP);
-        sandbox_shell("ip link set eth1 up; ip addr add " + host + " dev eth1 " + options);
-        _exit(testing::Test::HasFailure() ? 1 : 0);
-    }
-    int status = -1;
-    EXPECT_EQ(holder, waitpid(holder, &status, WUNTRACED));
-    sandbox_shell("ip link set eth1 netns " + std::to_string(holder));
-    kill(holder, SIGCONT);
-    EXPECT_EQ(holder, waitpid(holder, &status, 0));
-    EXPECT_EQ(0, status);
-    close(near);
-    return far;
-}
-
 // A socket of that network that listens on port 7 of `host`.
-int listen_far_away(int network, const std::string &host) {
-    const int near = open("/proc/self/ns/net", O_RDONLY | O_CLOEXEC);
-    EXPECT_EQ(0, setns(network, CLONE_NEWNET)) << strerror(errno);
+int listen_far_away(const FarNetwork &network, const std::string &host) {
     const sockaddr_storage at = address(host, ECHO_PORT);
-    const int listener = socket(at.ss_family, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    const int listener = network.make_socket(at.ss_family, SOCK_STREAM);
     EXPECT_EQ(0, bind(listener, reinterpret_cast<const sockaddr *>(&at), sizeof at))
         << strerror(errno);
     EXPECT_EQ(0, listen(listener, 2));
-    EXPECT_EQ(0, setns(near, CLONE_NEWNET)) << strerror(errno);
-    close(near);
     return listener;
 }
 
@@ -211,16 +182,17 @@ int listen_far_away(int network, const std::string &host) {
 void expect_hidden_in_a_sandbox(const std::string &near, const std::string &far) {
     run_in_sandbox(
         [&] {
-            std::string options;
+            std::string far_address = far;
             if (near.find(':') != std::string::npos) {
                 if (access("/proc/sys/net/ipv6/conf/eth0", F_OK) != 0)
                     GTEST_SKIP() << "this kernel has no IPv6";
-                options = "nodad";
+                far_address += " nodad";
                 sandbox_shell("echo 0 >/proc/sys/net/ipv6/conf/eth0/disable_ipv6; ip addr add " +
                               near + " dev eth0 nodad");
             }
             const std::string host = far.substr(0, far.find('/'));
-            const int listener = listen_far_away(make_far_network(far, options), host);
+            const FarNetwork network(far_address);
+            const int listener = listen_far_away(network, host);
             Connection connections[2];
             for (Connection &connection : connections) {
                 connection.near = connect_to(host, ECHO_PORT, 20);

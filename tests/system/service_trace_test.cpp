@@ -1,9 +1,6 @@
 // Requests that go on until the client has enough: system-call traces, resource traces, captures.
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <netinet/in.h>
-#include <poll.h>
-#include <sched.h>
 #include <signal.h>
 #include <sockhand.h>
 #include <string.h>
@@ -11,8 +8,10 @@
 #include <unistd.h>
 
 #include <string>
+#include <utility>
 #include <vector>
 
+#include "support/far_network.h"
 #include "support/packets.h"
 #include "support/process_state.h"
 #include "support/replies.h"
@@ -283,85 +282,18 @@ TEST(ServiceTraces, AResourceTraceWithoutAKnownItemSamplesTheFastSet) {
     });
 }
 
-// Both ends of a TCP connection from a namespace of its own at the other end of eth0: the server's
-// is returned, the client's is held by a process that copies what comes to its standard output.
-class RemoteClient {
-  public:
-    RemoteClient() {
-        int listener = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        sockaddr_storage ours = address("10.99.0.1", 0);
-        EXPECT_EQ(0, bind(listener, reinterpret_cast<sockaddr *>(&ours), sizeof(sockaddr_in)));
-        EXPECT_EQ(0, listen(listener, 1));
-        socklen_t length = sizeof ours;
-        EXPECT_EQ(0, getsockname(listener, reinterpret_cast<sockaddr *>(&ours), &length));
-        int go[2], out[2];
-        EXPECT_EQ(0, pipe2(go, O_CLOEXEC));
-        EXPECT_EQ(0, pipe2(out, O_CLOEXEC));
-        pid_ = fork();
-        if (pid_ == 0)
-            run(go[0], out[1], port_of(ours));
-        close(go[0]);
-        close(out[1]);
-        out_ = out[0];
-        char byte;
-        EXPECT_EQ(1, read(out_, &byte, 1)) << "no network namespace";
-        sandbox_shell("ip link set eth1 netns " + std::to_string(pid_));
-        EXPECT_EQ(1, write(go[1], "x", 1));
-        close(go[1]);
-        server_ = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
-        EXPECT_GE(server_, 0);
-        close(listener);
-    }
-    ~RemoteClient() {
-        close(out_);
-        if (server_ >= 0)
-            close(server_);
-        kill(pid_, SIGKILL);
-    }
-    RemoteClient(const RemoteClient &) = delete;
-    RemoteClient &operator=(const RemoteClient &) = delete;
-
-    int server() const { return server_; }
-    void close_server() {
-        close(server_);
-        server_ = -1;
-    }
-    // What the client receives.
-    int out() const { return out_; }
-
-  private:
-    [[noreturn]] static void run(int go, int out, uint16_t port) {
-        char block[65536];
-        if (unshare(CLONE_NEWNET) != 0 || write(out, "x", 1) != 1 || read(go, block, 1) != 1)
-            _exit(1);
-        if (system("PATH=$PATH:/sbin:/usr/sbin; ip link set lo up; "
-                   "ip addr add 10.99.0.2/24 dev eth1 && ip link set eth1 up") != 0)
-            _exit(1);
-        int fd = socket(AF_INET, SOCK_STREAM, 0);
-        sockaddr_storage server = address("10.99.0.1", port);
-        if (connect(fd, reinterpret_cast<sockaddr *>(&server), sizeof(sockaddr_in)) != 0)
-            _exit(1);
-        for (;;) {
-            ssize_t n = read(fd, block, sizeof block);
-            if (n <= 0 || write(out, block, static_cast<size_t>(n)) != n)
-                _exit(0);
-        }
-    }
-    pid_t pid_ = -1;
-    int out_ = -1;
-    int server_ = -1;
-};
-
 TEST(ServiceTraces, ACaptureHidesTheConnectionOfItsClient) {
     run_in_sandbox(
         [] {
             Service service;
-            RemoteClient remote;
+            FarNetwork far;
+            TcpConnection connection;
+            far.connect_to_us(&connection);
             const std::string message = std::string("/x") + '\0' + "cmd=pcapdump" + '\0';
             ASSERT_EQ(0, sockhand_send(service.cgi_socket().c_str(), message.data(),
-                                       static_cast<int>(message.size()), remote.server()));
-            remote.close_server();
-            Client client(remote.out());
+                                       static_cast<int>(message.size()), connection.server));
+            close(std::exchange(connection.server, -1));
+            Client client(std::exchange(connection.client, -1));
             const std::string header = ok_header("application/octet-stream", "pcapdump.cap");
             // Each frame that is seen makes one or two more on the wire, with its data and the
             // answer to that.

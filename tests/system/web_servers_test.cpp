@@ -1,11 +1,8 @@
 // The debug service behind the web servers that devices have, each with its sample configuration.
 #include <arpa/inet.h>
-#include <errno.h>
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <poll.h>
-#include <sched.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -16,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "support/far_network.h"
 #include "support/packets.h"
 #include "support/process_state.h"
 #include "support/run_program.h"
@@ -159,48 +157,6 @@ class BehindWebServer : public testing::TestWithParam<WebServer> {
     }
 };
 
-// A peer at the other end of eth0: a network of its own, with a single process in it.
-class OtherNetwork {
-  public:
-    OtherNetwork() : holder_({"/bin/sh", "-c", "echo && read x"}, in_new_network()) {
-        holder_.read_line();
-        const std::string pid = std::to_string(holder_.pid());
-        sandbox_shell("ip link set eth1 netns " + pid);
-        ours_ = open("/proc/self/ns/net", O_RDONLY | O_CLOEXEC);
-        theirs_ = open(("/proc/" + pid + "/ns/net").c_str(), O_RDONLY | O_CLOEXEC);
-        EXPECT_EQ(0, setns(theirs_, CLONE_NEWNET));
-        sandbox_shell("ip addr add 10.99.0.2/24 dev eth1 && ip link set eth1 up");
-        EXPECT_EQ(0, setns(ours_, CLONE_NEWNET));
-    }
-    ~OtherNetwork() {
-        close(ours_);
-        close(theirs_);
-    }
-    OtherNetwork(const OtherNetwork &) = delete;
-    OtherNetwork &operator=(const OtherNetwork &) = delete;
-
-    int make_socket(int type) const {
-        EXPECT_EQ(0, setns(theirs_, CLONE_NEWNET));
-        const int fd = socket(AF_INET, type | SOCK_CLOEXEC, 0);
-        EXPECT_EQ(0, setns(ours_, CLONE_NEWNET));
-        return fd;
-    }
-
-  private:
-    static RunOptions in_new_network() {
-        RunOptions options;
-        options.before_exec = [] {
-            if (unshare(CLONE_NEWNET) != 0)
-                perror("unshare");
-        };
-        return options;
-    }
-
-    Background holder_;
-    int ours_ = -1;
-    int theirs_ = -1;
-};
-
 int local_port(int fd) {
     sockaddr_in address = {};
     socklen_t length = sizeof(address);
@@ -223,8 +179,8 @@ bool has_port(const std::string &frame, int port) {
 bool is_client_in_its_capture(const WebServer &server) {
     InstalledService service;
     RunningServer web(server);
-    OtherNetwork other;
-    const int fd = other.make_socket(SOCK_STREAM);
+    FarNetwork far;
+    const int fd = far.make_socket(AF_INET, SOCK_STREAM);
     EXPECT_TRUE(connect_web(fd, "10.99.0.1"));
     const int port = local_port(fd);
     Client client(fd);
@@ -233,7 +189,7 @@ bool is_client_in_its_capture(const WebServer &server) {
     // The header of the capture tells that it has begun. What it shows of each datagram goes the
     // client's way, so there is something of that to show as well.
     client.read_until([](const std::string &reply) { return has_body(reply, 24); });
-    const int datagrams = other.make_socket(SOCK_DGRAM);
+    const int datagrams = far.make_socket(AF_INET, SOCK_DGRAM);
     sockaddr_in peer = web_address("10.99.0.1");
     peer.sin_port = htons(7777);
     std::string reply;
