@@ -178,7 +178,7 @@ TEST(ServiceTraces, TheIgnoredProcessIsLeftAlone) {
         EXPECT_FALSE(is_traced(ignored.pid()));
         client.close();
         EXPECT_TRUE(service.is_at_rest());
-        // By name it is traced nevertheless.
+        // Asked for by its id it is traced nevertheless.
         Client by_id = start_trace(service, ignored);
         by_id.close();
         EXPECT_TRUE(service.is_at_rest());
