@@ -269,10 +269,10 @@ TEST(Archive, EndsQuietlyWhenItsReaderGoesAwayDuringTheFirstSnapshot) {
     for (const char *form : {"-d", "-dt"}) {
         run_in_sandbox([form] {
             Background sleeper({"/bin/sleep", "1000"});
-            RunResult result =
-                run_program({"/bin/sh", "-c",
-                             "{ " + fieldkit_path() + " debugar.cgi " + form +
-                                 " -p /nonexistent; echo $? >&2; } | head -c 20000 | wc -c"});
+            RunResult result = run_program(
+                {"/bin/sh", "-c",
+                 "{ \"$0\" debugar.cgi $1 -p /nonexistent; echo $? >&2; } | head -c 20000 | wc -c",
+                 fieldkit_path(), form});
             EXPECT_EQ("20000\n", result.out);
             EXPECT_EQ("0\n", result.err.substr(result.err.size() - 2)) << result.err;
             expect_nothing_left(sleeper);
@@ -307,8 +307,8 @@ TEST(Archive, GivesItsOutputToNoProgramThatItStarts) {
             "/usr/sbin/gen_healthsheet.sh");
         for (const char *form : {"-d", "-dt"}) {
             RunResult result = run_program(
-                {"/bin/sh", "-c",
-                 fieldkit_path() + " debugar.cgi " + form + " -p /nonexistent | tail -c 1 | wc -c"},
+                {"/bin/sh", "-c", "\"$0\" debugar.cgi $1 -p /nonexistent | tail -c 1 | wc -c",
+                 fieldkit_path(), form},
                 {.timeout_s = 60});
             EXPECT_EQ("1\n", result.out);
         }
@@ -323,9 +323,8 @@ TEST(Archive, EndsQuietlyOnAFullDisk) {
             Background sleeper({"/bin/sleep", "1000"});
             ASSERT_EQ(0, mount("none", disk.path().c_str(), "tmpfs", 0, "size=65536"));
             RunResult result =
-                run_program({"/bin/sh", "-c",
-                             fieldkit_path() + " debugar.cgi " + form + " -p " +
-                                 cheap_core_writer(dir) + " >" + disk.path() + "/archive"});
+                run_program({"/bin/sh", "-c", "\"$0\" debugar.cgi $1 -p \"$2\" >\"$3\"",
+                             fieldkit_path(), form, cheap_core_writer(dir), disk / "archive"});
             EXPECT_EQ(0, result.exit_status);
             EXPECT_EQ(65536u, std::filesystem::file_size(disk / "archive"));
             expect_nothing_left(sleeper);
@@ -367,9 +366,9 @@ TEST(Archive, IsReadByTarAndGzip) {
         TempDir dir;
         RunResult result =
             run_program({"/bin/sh", "-c",
-                         fieldkit_path() + " debugar.cgi -d -p /nonexistent >" + dir.path() +
-                             "/a.tgz 2>/dev/null && cd " + dir.path() +
-                             " && gzip -t a.tgz && tar xzf a.tgz && ls debug-*/netdump.cap"});
+                         "\"$0\" debugar.cgi -d -p /nonexistent >\"$1/a.tgz\" 2>/dev/null && "
+                         "cd \"$1\" && gzip -t a.tgz && tar xzf a.tgz && ls debug-*/netdump.cap",
+                         fieldkit_path(), dir.path()});
         EXPECT_EQ(0, result.exit_status) << result.err;
         EXPECT_EQ("/netdump.cap\n", result.out.substr(result.out.find('/')));
     });

@@ -264,10 +264,9 @@ RunOptions with_broken(const std::string &library, const TempDir &dir) {
 // That this program itself has loaded.
 std::string path_of_sockhand() {
     std::ifstream maps("/proc/self/maps");
-    std::string word;
-    while (maps >> word) {
-        if (word.find("/libsockhand.so") != std::string::npos)
-            return word;
+    for (std::string line; std::getline(maps, line);) {
+        if (line.find("/libsockhand.so") != std::string::npos)
+            return line.substr(line.find('/'));
     }
     ADD_FAILURE() << "no libsockhand.so in this program";
     return "";

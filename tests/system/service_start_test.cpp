@@ -125,9 +125,9 @@ TEST(ServiceStart, SaysWhyItCannotDetach) {
         // The C library does not take just anything for /dev/null.
         sandbox_bind(dir.file("null", ""), "/dev/null");
         const std::string log = dir / "log";
-        RunResult result = run_program({"/bin/sh", "-c",
-                                        "exec " + fieldkit_path() + " debugar.cgi -c " +
-                                            (dir / "cgi") + " -s " + (dir / "segf") + " 2>" + log});
+        RunResult result =
+            run_program({"/bin/sh", "-c", "exec \"$0\" debugar.cgi -c \"$1\" -s \"$2\" 2>\"$3\"",
+                         fieldkit_path(), dir / "cgi", dir / "segf", log});
         EXPECT_EQ(0, result.exit_status) << "the first process does not wait for the second";
         EXPECT_TRUE(wait_until([&] { return std::filesystem::file_size(log) > 0; }));
         EXPECT_EQ("daemon\n: No such device\n", read_whole_file(log));

@@ -3,6 +3,7 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <string>
 
@@ -114,7 +115,7 @@ TEST_F(Snapcore, AProcessThatIsTracedAlreadyHasNoCoreAndRunsOn) {
 TEST_F(Snapcore, AFullDiskGivesNoHalfCore) {
     run_in_sandbox([] {
         // The sources may lie below /tmp.
-        sandbox_shell("cp " + snapcore() + " /run/snapcore");
+        std::filesystem::copy_file(snapcore(), "/run/snapcore");
         sandbox_shell("mount -t tmpfs -o size=64k tmpfs /tmp");
         Echo target;
         const RunResult result = run(target.pid(), "/run/snapcore");
@@ -130,10 +131,10 @@ TEST_F(Snapcore, LeavesNothingBehindWhenItsReaderGoesAway) {
     run_in_sandbox([] {
         Echo target;
         TempDir dir;
-        sandbox_shell("env -i TMPDIR=" + dir.path() + " " + snapcore() + " -c /dev/stdout " +
+        sandbox_shell("env -i TMPDIR='" + dir.path() + "' '" + snapcore() + "' -c /dev/stdout " +
                       target.pid() + " 2>/dev/null | head -c 100 >/dev/null");
         target.expect_answers();
-        sandbox_shell("test -z \"$(ls -A " + dir.path() + ")\"");
+        EXPECT_TRUE(std::filesystem::is_empty(dir.path()));
     });
 }
 
