@@ -4,9 +4,9 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <fstream>
 #include <string>
 
+#include "support/process_state.h"
 #include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/temp_dir.h"
@@ -32,29 +32,20 @@ class Snapcore : public testing::Test {
     }
 };
 
-std::string state_of(pid_t pid) {
-    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-    for (std::string line; std::getline(status, line);) {
-        if (line.compare(0, 7, "State:\t") == 0)
-            return line.substr(7, 1);
-    }
-    return "gone";
-}
-
 // A process that says a line for each line that it is told.
 class Echo {
   public:
     Echo() : process_({"/bin/cat"}) { expect_answers(); }
 
     std::string pid() const { return std::to_string(process_.pid()); }
-    std::string state() const { return state_of(process_.pid()); }
+    char state() const { return process_state(process_.pid()); }
     void expect_answers() {
         process_.write_input("hello\n");
         EXPECT_EQ("hello", process_.read_line());
     }
     void stop() {
         process_.send_signal(SIGSTOP);
-        EXPECT_TRUE(wait_until([&] { return state() == "T"; }));
+        EXPECT_TRUE(wait_until([&] { return state() == 'T'; }));
     }
     void resume() { process_.send_signal(SIGCONT); }
 
@@ -87,7 +78,7 @@ TEST_F(Snapcore, AStoppedProcessStaysStopped) {
     Echo target;
     target.stop();
     EXPECT_EQ(0, run(target.pid()).exit_status);
-    EXPECT_EQ("T", target.state());
+    EXPECT_EQ('T', target.state());
     target.resume();
     target.expect_answers();
 }
