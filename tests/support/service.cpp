@@ -230,3 +230,12 @@ std::string ok_header(const std::string &content_type, const std::string &file_n
            content_type + "\r\nContent-Disposition: attachment; filename=\"" + file_name +
            "\"\r\n\r\n";
 }
+
+std::string body_of(const std::string &reply, const std::string &header) {
+    const size_t end = reply.find("\r\n\r\n");
+    const size_t size = end == std::string::npos ? reply.size() : end + 4;
+    if (!header.empty()) {
+        EXPECT_EQ(header, reply.substr(0, size));
+    }
+    return reply.substr(size);
+}

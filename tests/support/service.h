@@ -81,3 +81,6 @@ class Service {
 
 // The header of a download.
 std::string ok_header(const std::string &content_type, const std::string &file_name);
+// What follows the header of a reply, if anything. Fails the test when the header is not `header`,
+// unless that is empty.
+std::string body_of(const std::string &reply, const std::string &header = "");

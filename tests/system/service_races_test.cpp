@@ -31,11 +31,6 @@ const SandboxOptions WITH_ETH0 = {.eth0 = true, .timeout_s = 110};
 constexpr char DEBUG_CGI[] = "/cgi/debug.cgi";
 constexpr char ARCHIVE[] = "/cgi/debug.tgz";
 
-std::string body_of(const std::string &reply) {
-    size_t end = reply.find("\r\n\r\n");
-    return end == std::string::npos ? "" : reply.substr(end + 4);
-}
-
 std::string core_reply(const std::string &pid) {
     return ok_header("application/octet-stream", "core") + "core of " + pid;
 }

@@ -67,11 +67,6 @@ void expect_end_of_trace(const Service &service, const Background &process) {
     EXPECT_TRUE(expect_free(process.pid()));
 }
 
-std::string body_of(const std::string &reply, const std::string &header) {
-    EXPECT_EQ(header, reply.substr(0, header.size()));
-    return reply.substr(std::min(header.size(), reply.size()));
-}
-
 int lines_with(const std::string &text, const std::string &part) {
     int count = 0;
     for (size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1))

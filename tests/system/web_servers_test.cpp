@@ -131,11 +131,6 @@ std::string status_of(const std::string &reply) {
     return reply.substr(0, 5) == "HTTP/" ? reply.substr(9, reply.find("\r\n") - 9) : reply;
 }
 
-std::string body_of(const std::string &reply) {
-    const size_t end = reply.find("\r\n\r\n");
-    return end == std::string::npos ? "" : reply.substr(end + 4);
-}
-
 bool has_body(const std::string &reply, size_t length) {
     return body_of(reply).size() >= length;
 }
