@@ -324,14 +324,6 @@ TEST(CoredumpUpload, FailsSilentlyWithoutLibcurl) {
     });
 }
 
-TEST(CoredumpUpload, IsTheOnlyOneToLoadLibcurl) {
-    // What the dynamic linker loads at the start, for every applet.
-    const RunResult result = run_program(
-        {fieldkit_path(), "ctest"}, {.env = {"LD_TRACE_LOADED_OBJECTS=1"}, .leak_check = false});
-    EXPECT_NE(std::string::npos, result.out.find("libc.so")) << result.out;
-    EXPECT_EQ(std::string::npos, result.out.find("curl")) << result.out;
-}
-
 TEST(CoredumpUpload, ReachesARealServerByteForByte) {
     if (run_program({"/bin/sh", "-c", "/usr/bin/python3 -c 'import pyftpdlib'"}).exit_status != 0)
         GTEST_SKIP() << "no FTP server on this machine (python3-pyftpdlib)";
