@@ -17,6 +17,7 @@
 #include "proc/process_table.h"
 #include "trace/stop_handlers.h"
 #include "trace/tracee_control.h"
+#include "util/clock.h"
 #include "util/spawn.h"
 #include "util/unique_fd.h"
 
@@ -27,6 +28,8 @@ constexpr uint32_t IN_SYSCALL = 1;            // the bit of TracedProcess::in_sy
 constexpr int SYSCALL_STOP = SIGTRAP | 0x80;  // as PTRACE_O_TRACESYSGOOD marks it
 constexpr long HELD_POLL_MS = 50;
 constexpr long LOCK_POLL_MS = 200;
+constexpr int STUCK_LOOKS = 10;
+constexpr useconds_t STUCK_POLL_US = 20000;
 constexpr unsigned LOOK_EVENTS = 64;
 constexpr int LOOK_PROCESSES = 8;
 
@@ -62,7 +65,8 @@ void drop(Trace *trace, int index) {
     trace->request->pids[index] = -1;
 }
 
-// Lets a process go on to its next system-call stop; one that cannot is dropped.
+// Lets a process go on to its next system-call stop; one that cannot is dropped. It still counts as
+// live: the trace then ends when there is nothing to wait for, and not with the last exit.
 bool step(Trace *trace, int index, int sig) {
     pid_t pid = trace->request->pids[index];
     if (trace_syscall(pid, sig) != -1)
@@ -114,6 +118,27 @@ void read_process_name(pid_t pid, char (&name)[TRACED_NAME_SIZE]) {
     const char *slash = strrchr(name, '/');
     if (slash != nullptr)
         memmove(name, slash + 1, strlen(slash + 1) + 1);
+}
+
+// Whether a process has been uninterruptible for some time. (One of the kernel's own may always be
+// so, and is refused at once.)
+bool is_stuck(pid_t pid) {
+    for (int look = 0; look < STUCK_LOOKS; ++look) {
+        if (!trace_is_uninterruptible(pid) || is_kernel_thread(pid))
+            return false;
+        (void)usleep(STUCK_POLL_US);
+    }
+    return true;
+}
+
+// Drops the processes that cannot be stopped: to wait for one of them, perhaps for ever, would hold
+// all those that are attached already.
+void drop_stuck_processes(Trace *trace) {
+    const TraceRequest &request = *trace->request;
+    for (int i = 0; i < request.nr_pids; ++i) {
+        if (request.pids[i] != -1 && is_stuck(request.pids[i]))
+            drop(trace, i);
+    }
 }
 
 void take_process(Trace *trace, int index) {
@@ -231,16 +256,10 @@ void on_stop(Trace *trace, int index, int status) {
 
 // ---- The loop ----
 
-int64_t now_ms() {
-    timespec now;
-    (void)clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
-}
-
 // Lets processes go on that were held and have been sent SIGCONT. The kernel wakes a tracee for no
 // signal but SIGKILL, and does not tell its tracer either, so this is looked for now and then.
 void step_continued(Trace *trace) {
-    int64_t now = now_ms();
+    int64_t now = monotonic_ms();
     if (now - trace->looked_ms < HELD_POLL_MS)
         return;
     trace->looked_ms = now;
@@ -366,19 +385,41 @@ void stop_timer(Trace *trace) {
     trace->timer = -1;
 }
 
-void release_processes(TraceRequest *request, bool list_fds) {
+// Those that are stopped do nothing until they are let go, so they come first. The others have to
+// be stopped for it; the last are those that take their time for that.
+void release_processes(TraceRequest *request) {
     for (int i = 0; i < request->nr_pids; ++i) {
         if (request->pids[i] == -1)
             continue;
-        if (list_fds)
+        if ((request->flags & TRACE_LIST_FDS) != 0)
             trace_list_fds(request, request->pids[i]);
-        trace_detach(request->pids[i]);
+        request->records[i].released = trace_detach_stopped(request->pids[i]);
+    }
+    for (bool uninterruptible : {false, true}) {
+        for (int i = 0; i < request->nr_pids; ++i) {
+            bool &released = request->records[i].released;
+            if (request->pids[i] == -1 || released ||
+                (!uninterruptible && trace_is_uninterruptible(request->pids[i])))
+                continue;
+            trace_detach(request->pids[i]);
+            released = true;
+        }
+    }
+}
+
+// Lets go of the processes of a caller who is their tracer already, where there can be no trace.
+void refuse(const TraceRequest &request) {
+    for (int i = 0; request.attached != 0 && i < request.nr_pids; ++i) {
+        if (request.pids[i] != -1)
+            trace_detach(request.pids[i]);
     }
 }
 
 // The trace proper, with records and buffer in place.
 void run_trace(Trace *trace) {
     TraceRequest *request = trace->request;
+    if (request->attached == 0)
+        drop_stuck_processes(trace);
     for (int i = 0; i < request->nr_pids; ++i) {
         if (request->pids[i] != -1)
             take_process(trace, i);
@@ -388,7 +429,7 @@ void run_trace(Trace *trace) {
     if (start_timer(trace))
         follow(trace);
     stop_timer(trace);
-    release_processes(request, (request->flags & TRACE_LIST_FDS) != 0);
+    release_processes(request);
 }
 
 void run(TraceRequest *request) {
@@ -419,13 +460,13 @@ void trace_run(TraceRequest *request) {
         request->records = records.get();
         if (provide_buffer(request))
             run(request);
-        else if (request->attached != 0)
-            release_processes(request, false);
+        else
+            refuse(*request);
         request->records = nullptr;
         forget_last_process();
         (void)pthread_mutex_unlock(&trace_mutex);
-    } else if (request->attached != 0) {
-        release_processes(request, false);
+    } else {
+        refuse(*request);
     }
     free(request->buf);
     request->buf = nullptr;

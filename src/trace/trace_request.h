@@ -34,6 +34,7 @@ struct TracedProcess {
     uint32_t in_syscall;          // bit 0: the last system-call stop was an entry
     bool stop_told;               // it was let go on with a signal, which may stop it
     bool held;                    // left in the stop that such a signal made, until SIGCONT
+    bool released;                // at the end: let go of
     TraceRegisters regs;          // as at that entry
     unsigned long exit_record;    // the result word of the last exit stop
 };

@@ -96,9 +96,8 @@ bool is_job_control_signal(int sig) {
     return sig == SIGSTOP || sig == SIGTSTP || sig == SIGTTIN || sig == SIGTTOU;
 }
 
-void detach(pid_t pid, int sig) {
-    if (signal_request(PTRACE_DETACH, pid, sig) != -1)
-        return;
+// Lets go of a tracee that is not stopped, as far as is known.
+void stop_and_detach(pid_t pid, int sig) {
     // It runs, or it is not ours: ended and reaped, or replaced by an execve of another thread. A
     // stranger must not be stopped, as nobody would let it go on.
     if (tracee_status(pid).tracer != syscall(SYS_gettid))
@@ -108,7 +107,7 @@ void detach(pid_t pid, int sig) {
     for (;;) {
         int status;
         if (wait_for_stop(pid, &status) == -1) {
-            if (errno == EINVAL)
+            if (errno == EINVAL)  // no answer about the process, so it is asked again
                 continue;
             return;
         }
@@ -160,8 +159,21 @@ int trace_attach(pid_t pid) {
 }
 
 void trace_detach(pid_t pid, int sig) {
-    detach(pid, sig);
+    if (trace_detach_stopped(pid, sig))
+        return;
+    stop_and_detach(pid, sig);
     release_child(pid);
+}
+
+bool trace_detach_stopped(pid_t pid, int sig) {
+    if (signal_request(PTRACE_DETACH, pid, sig) == -1)
+        return false;
+    release_child(pid);
+    return true;
+}
+
+bool trace_is_uninterruptible(pid_t pid) {
+    return tracee_status(pid).state == 'D';
 }
 
 void trace_set_options(pid_t pid, unsigned long options) {

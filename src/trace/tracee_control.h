@@ -11,9 +11,16 @@
 // then nothing is attached; else the result of the last wait.
 int trace_attach(pid_t pid);
 
-// Lets go of `pid`, with the signal `sig` delivered, stopping it first if it runs. Does nothing to
-// a process that is not the calling thread's tracee.
+// Lets go of `pid`, with the signal `sig` delivered, stopping it first if it runs: that takes until
+// it can be interrupted. Does nothing to a process that is not the calling thread's tracee.
 void trace_detach(pid_t pid, int sig = 0);
+
+// The same of a stopped tracee only. Returns whether it was one.
+bool trace_detach_stopped(pid_t pid, int sig = 0);
+
+// Whether `pid` is in the midst of something that no signal interrupts, so that it could not be
+// stopped now: a driver or a file server, mostly, that does not answer.
+bool trace_is_uninterruptible(pid_t pid);
 
 // Sets ptrace options of `pid`, a stopped tracee.
 void trace_set_options(pid_t pid, unsigned long options);

@@ -2,17 +2,12 @@
 
 #include <poll.h>
 #include <sys/ioctl.h>
-#include <time.h>
+
+#include "util/clock.h"
 
 namespace {
 
 constexpr int LOOK_INTERVAL_MS = 1000;
-
-int64_t now_ms() {
-    timespec now;
-    (void)clock_gettime(CLOCK_MONOTONIC, &now);  // which cannot fail
-    return static_cast<int64_t>(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
-}
 
 // Bytes that the reader has not taken yet, of a socket or else a pipe; -1: not known.
 int untaken_bytes(int fd) {
@@ -27,7 +22,7 @@ bool await_reader(int fd, int patience_s, const std::atomic<uint32_t> *wanted) {
     if (poll(&output, 1, 0) > 0)
         return true;
     int untaken = untaken_bytes(fd);
-    int64_t taken_ms = now_ms();  // when the reader last took something
+    int64_t taken_ms = monotonic_ms();  // when the reader last took something
     for (;;) {
         const int ready = poll(&output, 1, LOOK_INTERVAL_MS);
         if (ready > 0)
@@ -36,8 +31,8 @@ bool await_reader(int fd, int patience_s, const std::atomic<uint32_t> *wanted) {
             return false;
         const int left = untaken_bytes(fd);
         if (left != untaken)
-            taken_ms = now_ms();
-        else if (now_ms() - taken_ms >= int64_t{patience_s} * 1000)
+            taken_ms = monotonic_ms();
+        else if (monotonic_ms() - taken_ms >= int64_t{patience_s} * 1000)
             return false;
         untaken = left;
     }

@@ -12,6 +12,8 @@
 
 #include <atomic>
 
+#include "util/clock.h"
+
 namespace {
 
 // A child until it has been waited for. A pid may stand in the list twice, when its number is used
@@ -34,8 +36,8 @@ std::atomic<int> waiting_tracers;
 // How often and for how long a waiter looks for the status of a child that is gone. A tracer
 // delivers it in an instant; it never comes when the end was taken by anyone else, such as the
 // kernel where SIGCHLD is ignored.
-constexpr int STATUS_POLLS = 5000;
 constexpr long STATUS_POLL_MS = 1;
+constexpr int64_t STATUS_PATIENCE_MS = 5000;
 
 // Between two looks at a child with a stop that is for a tracer who has not claimed it.
 constexpr long STOP_POLL_MS = 20;
@@ -171,9 +173,17 @@ pid_t wait_for_own_tracee(pid_t pid, int *status) {
     return waited;
 }
 
+// Whether the patience that begins with the first call, `*since` being 0, has ended.
+bool is_over(int64_t *since) {
+    if (*since == 0)
+        *since = monotonic_ms();
+    return monotonic_ms() - *since >= STATUS_PATIENCE_MS;
+}
+
 pid_t wait_for_end(pid_t pid, int *status) {
     bool stop_seen = false;
-    for (int polls = STATUS_POLLS;;) {
+    int64_t gone_ms = 0;  // since when there is no child and no status
+    for (;;) {
         switch (await_tracer(pid, status)) {
             case Wait::DONE:
                 return pid;
@@ -193,7 +203,7 @@ pid_t wait_for_end(pid_t pid, int *status) {
             if (stop_seen)
                 sleep_ms(STOP_POLL_MS);
             stop_seen = true;
-        } else if (waiting_tracers == 0 || --polls == 0) {
+        } else if (waiting_tracers == 0 || is_over(&gone_ms)) {
             // Asked in this order: a tracer that is not waiting any more has brought its status.
             if (take_or_forget(pid, status))
                 return pid;

@@ -5,7 +5,8 @@
 // the same process is to handle. This module keeps the two out of each other's way: a waiter leaves
 // stops to the tracer, and a tracer that has reaped a child leaves its status here for the waiter.
 // It works for all who start children with fork_child, wait for them with wait_for_child, and trace
-// with claim_child, wait_as_tracer and release_child. Any thread may call each of them.
+// with claim_child, wait_as_tracer and release_child. Any thread may call each of them. SIGCHLD
+// must not be ignored: the kernel would keep no status of any child.
 #pragma once
 
 #include <sys/types.h>
@@ -38,5 +39,6 @@ bool claim_child(pid_t pid);
 // calling thread has claimed `pid`.
 void release_child(pid_t pid);
 
-// waitpid for a thread that traces: hands on the status of what has ended to whoever waits for it.
+// waitpid for a thread that traces, with a `status` that is not null: hands on the status of what
+// has ended to whoever waits for it.
 pid_t wait_as_tracer(pid_t pid, int *status, int options);

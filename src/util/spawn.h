@@ -7,8 +7,9 @@
 
 // Starts the executable `path` (a full path: PATH is not searched) with the null-terminated vectors
 // `argv` and `envp` (null: no environment). The three descriptors become 0, 1 and 2 of the child,
-// which also inherits everything else that is not marked close-on-exec; the caller keeps its own.
-// With `trace_me` the child becomes a ptrace tracee of the caller and stops with SIGTRAP at its
+// in this order: 0, 1 or 2 in the place of another is what it has become by then. The child
+// inherits everything else that is not marked close-on-exec as well; the caller keeps its own. With
+// `trace_me` the child becomes a ptrace tracee of the caller and stops with SIGTRAP at its
 // successful execve.
 //
 // Returns the child's pid, to be reaped with wait_for_child (or after forget_child), or -1 with

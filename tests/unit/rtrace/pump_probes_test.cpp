@@ -129,6 +129,8 @@ TEST_F(PumpProbes, OutputDoesNotProlongThePass) {
     const Probe &third = add_probe(13);
     std::thread writer([&] {
         write_output(first, "a");
+        while (left_in(first) > 0)
+            std::this_thread::sleep_for(milliseconds(1));
         std::this_thread::sleep_for(milliseconds(1500));
         write_output(second, "b");
         std::this_thread::sleep_for(milliseconds(1500));

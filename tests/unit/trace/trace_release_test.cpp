@@ -3,6 +3,10 @@
 #include <pthread.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "support/slow_machine.h"
 #include "trace/trace_engine.h"
 #include "unit/trace/tracees.h"
@@ -105,6 +109,64 @@ TEST_F(TraceRun, LetsManyProcessesGoAtOnce) {
     trace_run(&request);
     for (pid_t pid : pids)
         EXPECT_TRUE(runs_free(pid)) << process_state(pid);
+}
+
+TEST_F(TraceRun, LeavesOutAProcessThatCannotBeStopped) {
+    int pipe_fds[2];
+    ASSERT_EQ(pipe(pipe_fds), 0);
+    Child stuck([&] {
+        wait_uninterruptibly(pipe_fds[0]);
+        sleep_for_ever();
+    });
+    ASSERT_TRUE(wait_until([&] { return process_state(stuck.pid()) == 'D'; }));
+    Child calling(call_for_ever);
+    TraceLog log;
+    log.polls_wanted = 100;
+    std::vector<pid_t> pids = {calling.pid(), stuck.pid()};
+    TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+    trace_run(&request);
+    EXPECT_EQ(log.polls, 100);
+    EXPECT_EQ(pids, (std::vector<pid_t>{calling.pid(), -1}));
+    EXPECT_TRUE(runs_free(calling.pid()));
+    EXPECT_EQ(status_field(stuck.pid(), "TracerPid:\t"), "0");
+    (void)!write(pipe_fds[1], "", 1);
+    EXPECT_TRUE(wait_until([&] { return process_state(stuck.pid()) == 'S'; })) << "as if untouched";
+    close(pipe_fds[0]);
+    close(pipe_fds[1]);
+}
+
+TEST_F(TraceRun, LetsOthersGoBeforeAProcessThatCannotBeStoppedAnyMore) {
+    int begin_fds[2], end_fds[2];
+    ASSERT_EQ(pipe(begin_fds), 0);
+    ASSERT_EQ(pipe(end_fds), 0);
+    Child stuck([&] {
+        char byte;
+        (void)!read(begin_fds[0], &byte, 1);
+        wait_uninterruptibly(end_fds[0]);
+        sleep_for_ever();
+    });
+    Child sleeping(sleep_for_ever), calling(call_for_ever);
+    TraceLog log;
+    log.end_when = [&] {
+        if (log.polls == 10)
+            (void)!write(begin_fds[1], "", 1);
+        return process_state(stuck.pid()) == 'D';
+    };
+    std::atomic<bool> ended = false;
+    std::thread tracer([&] {
+        std::vector<pid_t> pids = {stuck.pid(), sleeping.pid(), calling.pid()};
+        TraceRequest request = request_for(&log, &pids, TRACE_SYSCALLS);
+        trace_run(&request);
+        ended = true;
+    });
+    EXPECT_TRUE(wait_until([&] { return process_state(stuck.pid()) == 'D'; }));
+    EXPECT_TRUE(wait_until([&] { return runs_free(sleeping.pid()) && runs_free(calling.pid()); }));
+    EXPECT_FALSE(ended);
+    (void)!write(end_fds[1], "", 1);
+    tracer.join();
+    EXPECT_TRUE(runs_free(stuck.pid()));
+    for (int fd : {begin_fds[0], begin_fds[1], end_fds[0], end_fds[1]})
+        close(fd);
 }
 
 TEST_F(TraceRun, SurvivesProcessesThatEndWhileItLetsThemGo) {

@@ -82,11 +82,7 @@ class Waiting {
         (void)!pipe2(taken_pipe, O_NONBLOCK);
         child_ = std::make_unique<Child>([this] {
             signal(SIGHUP, [](int) { (void)!write(taken_pipe[1], "", 1); });
-            if (syscall(SYS_clone, CLONE_VFORK | SIGCHLD, 0, 0, 0, 0) == 0) {
-                char byte;
-                (void)!read(go_pipe_[0], &byte, 1);
-                _exit(0);
-            }
+            wait_uninterruptibly(go_pipe_[0]);
             sleep_for_ever();
         });
         EXPECT_TRUE(wait_until([&] { return process_state(pid()) == 'D'; }));

@@ -3,6 +3,7 @@
 
 #include <errno.h>
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <string.h>
@@ -85,6 +86,16 @@ inline void receive_signals() {
 inline void yield_and_sleep() {
     for (;;)
         usleep(50);
+}
+
+// Waits in the kernel, for the child of a vfork, where no signal interrupts it, until something can
+// be read from `fd`.
+inline void wait_uninterruptibly(int fd) {
+    if (syscall(SYS_clone, CLONE_VFORK | SIGCHLD, 0, 0, 0, 0) == 0) {
+        char byte;
+        (void)!read(fd, &byte, 1);
+        _exit(0);
+    }
 }
 
 // The texts and exits that a trace hands out. It ends the trace with the poll number `polls_wanted`
