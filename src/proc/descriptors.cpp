@@ -125,8 +125,6 @@ int describe_fd(pid_t pid, int fd, char *buf, size_t size, SocketSnapshot *socke
 
 int describe_socket_inode(pid_t, unsigned long inode, char *buf, size_t size) {
     constexpr char NET_DIR[] = "/proc/net";
-    if (!sockets_can_be_known())
-        return describe_socket_inode_in(NET_DIR, inode, buf, size);
     int length = describe_known_socket(inode, buf, size);
     if (length != NO_MATCH)
         return length;
@@ -140,7 +138,9 @@ int describe_socket_inode(pid_t, unsigned long inode, char *buf, size_t size) {
     // not hold any more, and the table is read again.
     char name[SOCKET_LINE_SIZE];
     char text[SOCKET_LINE_SIZE] = "";
-    int name_length = diag_unix_name(inode, name, sizeof name);
+    int name_length = sockets_can_be_known(SocketKind::UNIX)
+                          ? diag_unix_name(inode, name, sizeof name)
+                          : DIAG_UNKNOWN;
     length = search_unix_table(NET_DIR, inode, text, sizeof text);
     if (length == NO_MATCH)
         return 0;

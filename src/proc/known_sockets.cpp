@@ -1,9 +1,10 @@
 #include "proc/known_sockets.h"
 
 #include <pthread.h>
-#include <stdint.h>
 #include <string.h>
 #include <sys/un.h>
+
+#include <algorithm>
 
 #include "proc/socket_diag.h"
 #include "util/line_text.h"
@@ -14,11 +15,9 @@ constexpr size_t SLOTS = 256;  // by inode: a newer socket takes an older one's 
 constexpr size_t NAME_SIZE = sizeof(sockaddr_un::sun_path);
 constexpr size_t TEXT_SIZE = NAME_SIZE + 3;
 
-// As many questions about known sockets in a row without an answer, and the kernel is taken to have
-// none: also to ask costs time.
+// As many questions in a row about sockets that are in the tables without an answer, and the kernel
+// is taken to have none: also to ask costs time, much where it looks for a module each time.
 constexpr int MAX_SILENCE = 8;
-
-enum class Kind : uint8_t { NONE, TCP, UNIX };
 
 struct UnixSocket {
     int name_length;
@@ -27,7 +26,8 @@ struct UnixSocket {
 };
 
 struct KnownSocket {
-    Kind kind;
+    bool known;
+    SocketKind kind;
     unsigned long inode;
     union {
         TcpSocket tcp;
@@ -37,7 +37,7 @@ struct KnownSocket {
 
 pthread_mutex_t lock = PTHREAD_MUTEX_INITIALIZER;
 KnownSocket known[SLOTS];
-int silence = 0;
+int silence[2];  // by kind
 
 class Lock {
   public:
@@ -47,8 +47,25 @@ class Lock {
     Lock &operator=(const Lock &) = delete;
 };
 
+void note_answer(SocketKind kind, bool answered) {
+    int &count = silence[static_cast<size_t>(kind)];
+    count = answered ? 0 : std::min(count + 1, MAX_SILENCE);
+}
+
+bool answers(SocketKind kind) {
+    return silence[static_cast<size_t>(kind)] < MAX_SILENCE;
+}
+
+KnownSocket *remember(unsigned long inode, SocketKind kind) {
+    KnownSocket &slot = known[inode % SLOTS];
+    slot.known = true;
+    slot.kind = kind;
+    slot.inode = inode;
+    return &slot;
+}
+
 int describe(const KnownSocket &socket, char *buf, size_t size) {
-    if (socket.kind == Kind::TCP) {
+    if (socket.kind == SocketKind::TCP) {
         int state = diag_tcp_state(socket.tcp, socket.inode);
         if (state == DIAG_UNKNOWN)
             return NO_MATCH;
@@ -73,45 +90,41 @@ int describe(const KnownSocket &socket, char *buf, size_t size) {
 int describe_known_socket(unsigned long inode, char *buf, size_t size) {
     Lock guard;
     KnownSocket &socket = known[inode % SLOTS];
-    if (socket.kind == Kind::NONE || socket.inode != inode)
+    if (!socket.known || socket.inode != inode)
         return NO_MATCH;
     int length = describe(socket, buf, size);
-    silence = length != NO_MATCH ? 0 : silence + 1;
-    if (length == NO_MATCH)
-        socket.kind = Kind::NONE;
+    socket.known = length != NO_MATCH;
+    note_answer(socket.kind, socket.known);
     return length;
 }
 
 void remember_tcp_socket(unsigned long inode, const TcpSocket &socket) {
     Lock guard;
-    KnownSocket &slot = known[inode % SLOTS];
-    slot.kind = Kind::TCP;
-    slot.inode = inode;
-    slot.tcp = socket;
+    if (answers(SocketKind::TCP))
+        remember(inode, SocketKind::TCP)->tcp = socket;
 }
 
 void remember_unix_socket(unsigned long inode, const char *name, int name_length,
                           const char *text) {
+    Lock guard;
+    note_answer(SocketKind::UNIX, name_length >= 0);
     if (name_length < 0 || static_cast<size_t>(name_length) > NAME_SIZE ||
         strlen(text) >= TEXT_SIZE)
         return;
-    Lock guard;
-    KnownSocket &slot = known[inode % SLOTS];
-    slot.kind = Kind::UNIX;
-    slot.inode = inode;
-    slot.unix_socket.name_length = name_length;
-    memcpy(slot.unix_socket.name, name, static_cast<size_t>(name_length));
-    memcpy(slot.unix_socket.text, text, strlen(text) + 1);
+    UnixSocket &socket = remember(inode, SocketKind::UNIX)->unix_socket;
+    socket.name_length = name_length;
+    memcpy(socket.name, name, static_cast<size_t>(name_length));
+    memcpy(socket.text, text, strlen(text) + 1);
 }
 
-bool sockets_can_be_known() {
+bool sockets_can_be_known(SocketKind kind) {
     Lock guard;
-    return silence < MAX_SILENCE;
+    return answers(kind);
 }
 
 void forget_sockets() {
     Lock guard;
-    silence = 0;
+    silence[0] = silence[1] = 0;
     for (KnownSocket &socket : known)
-        socket.kind = Kind::NONE;
+        socket.known = false;
 }

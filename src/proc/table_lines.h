@@ -21,11 +21,10 @@ bool find_line(const char *net_dir, SocketTable table, Look look) {
     char path[128];
     (void)snprintf(path, sizeof path, "%s/%s", net_dir,
                    SOCKET_TABLE_NAMES[static_cast<size_t>(table)]);
+    char block[4096];  // what one read of such a table gives at most
     UniqueFile file(fopen(path, "re"));
     if (file == nullptr)
         return false;
-    // What one read of such a table gives at most.
-    char block[4096];
     (void)setvbuf(file.get(), block, _IOFBF, sizeof block);
     char line[SOCKET_LINE_SIZE];
     while (fgets(line, sizeof line, file.get()) != nullptr) {

@@ -180,20 +180,27 @@ TEST(DescribeFd, TellsAProcessFromAnotherThatHasTakenItsNumber) {
 }
 
 TEST(DescribeFd, ShowsAListeningSocketWithTheRemoteSideZero) {
-    int port;
-    UniqueFd fd = listen_on_loopback(AF_INET, &port);
-    EXPECT_EQ(
-        link_text(fd.get()) + "[127.0.0.1:" + std::to_string(port) + " -> 0.0.0.0:0][TCP_LISTEN]",
-        describe(fd.get()));
+    run_in_sandbox([] {
+        forget_last_process();
+        int port;
+        UniqueFd fd = listen_on_loopback(AF_INET, &port);
+        EXPECT_EQ(link_text(fd.get()) + "[127.0.0.1:" + std::to_string(port) +
+                      " -> 0.0.0.0:0][TCP_LISTEN]",
+                  describe(fd.get()));
+    });
 }
 
 TEST(DescribeFd, ShowsAConnectionsEndsAndState) {
-    int port;
-    UniqueFd listener = listen_on_loopback(AF_INET, &port);
-    UniqueFd client = connect_to(listener.get());
-    EXPECT_EQ(link_text(client.get()) + "[127.0.0.1:" + std::to_string(local_port(client.get())) +
-                  " -> 127.0.0.1:" + std::to_string(port) + "][TCP_ESTABLISHED]",
-              describe(client.get()));
+    run_in_sandbox([] {
+        forget_last_process();
+        int port;
+        UniqueFd listener = listen_on_loopback(AF_INET, &port);
+        UniqueFd client = connect_to(listener.get());
+        EXPECT_EQ(link_text(client.get()) +
+                      "[127.0.0.1:" + std::to_string(local_port(client.get())) +
+                      " -> 127.0.0.1:" + std::to_string(port) + "][TCP_ESTABLISHED]",
+                  describe(client.get()));
+    });
 }
 
 TEST(DescribeFd, ShowsAnIpv6Connection) {
@@ -235,16 +242,19 @@ TEST(DescribeFd, ShowsADatagramSocketAsTheLinkAlone) {
 }
 
 TEST(DescribeFd, ReportsMoreThanFitsWhenASocketsTextIsCut) {
-    int port;
-    UniqueFd fd = listen_on_loopback(AF_INET, &port);
-    std::string whole = describe(fd.get());
-    for (size_t size = link_text(fd.get()).size() + 1; size < whole.size() + 2; ++size) {
-        std::string buf(size + 1, '#');
-        EXPECT_EQ(static_cast<int>(whole.size()),
-                  describe_fd(getpid(), fd.get(), buf.data(), size));
-        EXPECT_EQ(whole.substr(0, size - 1), buf.c_str());
-        EXPECT_EQ('#', buf[size]);
-    }
+    run_in_sandbox([] {
+        forget_last_process();
+        int port;
+        UniqueFd fd = listen_on_loopback(AF_INET, &port);
+        std::string whole = describe(fd.get());
+        for (size_t size = link_text(fd.get()).size() + 1; size < whole.size() + 2; ++size) {
+            std::string buf(size + 1, '#');
+            EXPECT_EQ(static_cast<int>(whole.size()),
+                      describe_fd(getpid(), fd.get(), buf.data(), size));
+            EXPECT_EQ(whole.substr(0, size - 1), buf.c_str());
+            EXPECT_EQ('#', buf[size]);
+        }
+    });
 }
 
 // Made-up tables.

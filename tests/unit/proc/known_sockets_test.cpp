@@ -307,17 +307,31 @@ TEST(KnownSockets, AreForgottenInAnotherNetwork) {
 
 TEST(KnownSockets, AreNotAskedForInVainForEver) {
     in_new_network([] {
-        EXPECT_TRUE(sockets_can_be_known());
+        EXPECT_TRUE(sockets_can_be_known(SocketKind::TCP));
         for (unsigned long inode = 1; inode <= 8; ++inode) {
             remember_tcp_socket(inode, {});
             EXPECT_EQ("-1 (nothing)", from_memory(inode));
         }
-        EXPECT_FALSE(sockets_can_be_known());
+        EXPECT_FALSE(sockets_can_be_known(SocketKind::TCP));
+        EXPECT_TRUE(sockets_can_be_known(SocketKind::UNIX)) << "which is another matter";
         UniqueFd listener = bound_socket(AF_INET);
         ASSERT_EQ(0, listen(listener.get(), 5));
         EXPECT_NE("0 (nothing)", both(listener));
+        EXPECT_EQ("-1 (nothing)", from_memory(inode_of(listener)));
         // The next trace tries again.
         forget_last_process();
-        EXPECT_TRUE(sockets_can_be_known());
+        EXPECT_TRUE(sockets_can_be_known(SocketKind::TCP));
     });
+}
+
+TEST(KnownSockets, AreNotAskedForTheirNamesInVainForEver) {
+    for (unsigned long inode = 1; inode <= 8; ++inode) {
+        EXPECT_TRUE(sockets_can_be_known(SocketKind::UNIX));
+        remember_unix_socket(inode, "", -1, "[@name]");
+        EXPECT_EQ("-1 (nothing)", from_memory(inode));
+    }
+    EXPECT_FALSE(sockets_can_be_known(SocketKind::UNIX));
+    EXPECT_TRUE(sockets_can_be_known(SocketKind::TCP));
+    forget_last_process();
+    EXPECT_TRUE(sockets_can_be_known(SocketKind::UNIX));
 }
