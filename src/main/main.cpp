@@ -37,6 +37,9 @@ const char *base_name(const char *path) {
 int main(int argc, char **argv) {
     // A reader that goes away is an error of the write, in every applet.
     (void)signal(SIGPIPE, SIG_IGN);
+    // Some who start programs ignore it, and that would be inherited: nothing would be told of
+    // children that have ended.
+    (void)signal(SIGCHLD, SIG_DFL);
 
     const char *name = argc > 0 ? base_name(argv[0]) : TOOLBOX_NAME;
     if (strcmp(name, TOOLBOX_NAME) == 0) {

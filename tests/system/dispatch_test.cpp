@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "support/process_state.h"
 #include "support/run_program.h"
 #include "support/sandbox.h"
 #include "support/temp_dir.h"
@@ -103,6 +104,14 @@ TEST(Dispatcher, IgnoresABrokenPipeInEveryApplet) {
     for (const std::vector<std::string> &applet : applets)
         EXPECT_EQ(0, run_fieldkit(applet, options).signal) << applet[0];
     close(ends[1]);
+}
+
+TEST(Dispatcher, HearsOfItsChildrenAlsoWhereItsStarterIgnoredThem) {
+    Background applet({fieldkit_path(), "fdleak", "1000"},
+                      {.leak_check = false, .before_exec = [] { signal(SIGCHLD, SIG_IGN); }});
+    EXPECT_EQ("leaked 16", applet.read_line());
+    const std::string ignored = status_field(applet.pid(), "SigIgn:");
+    EXPECT_EQ(0u, std::stoull(ignored, nullptr, 16) >> (SIGCHLD - 1) & 1) << ignored;
 }
 
 TEST(Ctest, PrintsOneLineAndExitsWithZero) {
