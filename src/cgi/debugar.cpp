@@ -73,8 +73,8 @@ int open_segf_socket(const char *path) {
     return segf_socket.release();
 }
 
-// Ends the service if its libraries are broken: better at the start, where somebody looks, than at
-// the first request.
+// Ends the service if it cannot have the library: better at the start, where somebody looks, than
+// at the first request.
 void try_form_variables() {
     CGI_set_query("");
     CGI_save_env();

@@ -1,6 +1,7 @@
 #include "cgi/service_loop.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <pthread.h>
 #include <stdio.h>
@@ -46,10 +47,20 @@ bool take_request(int cgi_socket) {
     return true;
 }
 
+int accept_connection(int listener) {
+    int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+    if (fd == -1 && errno == ENOSYS) {  // MIPS before Linux 2.6.33
+        fd = accept(listener, nullptr, nullptr);
+        if (fd != -1)
+            (void)fcntl(fd, F_SETFD, FD_CLOEXEC);
+    }
+    return fd;
+}
+
 // A failed accept is passed on as well: a client that waits is then disconnected with an empty
 // core, and asks again.
 void take_core(int segf_socket) {
-    int core_fd = accept4(segf_socket, nullptr, nullptr, SOCK_CLOEXEC);
+    int core_fd = accept_connection(segf_socket);
     (void)send_dump(core_fd, "core");
     // For want of descriptors, mostly. The connection waits on, and the loop must not spin on it.
     if (core_fd == -1)

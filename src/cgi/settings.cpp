@@ -6,7 +6,7 @@
 
 namespace {
 
-// Kept as it is known: the "[pids...]" are not read, and "-k" is not told.
+// Kept as it is known: the "[pids...]" are not read, and "-k" and "-n" are not told.
 constexpr char USAGE[] =
     "dbg-cgi 0.1\n"
     "dbg-cgi [options] [pids...]\n"

@@ -9,6 +9,7 @@
 #include <sockhand.h>
 #include <stdio.h>
 #include <string.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -207,6 +208,11 @@ int Service::threads() const {
 
 int Service::children() const {
     return static_cast<int>(children_of(pid()).size());
+}
+
+void Service::limit_descriptors(unsigned count) const {
+    const rlimit limit = {count, 1024};
+    EXPECT_EQ(0, prlimit(pid(), RLIMIT_NOFILE, &limit, nullptr)) << strerror(errno);
 }
 
 bool Service::is_at_rest(int timeout_s) const {

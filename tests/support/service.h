@@ -68,6 +68,8 @@ class Service {
     int descriptors() const;
     int threads() const;
     int children() const;
+    // From now on it can have `count` descriptors, numbered from 0.
+    void limit_descriptors(unsigned count) const;
     // Waits until it holds as much as when it had just started.
     bool is_at_rest(int timeout_s = 20) const;
 

@@ -1,10 +1,13 @@
 // Crash dumps on their way through the service: from a process that just died, or from the spool,
 // to the client that waits for one.
+#include <errno.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <string.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -13,6 +16,7 @@
 #include <vector>
 
 #include "support/process_state.h"
+#include "support/refused_calls.h"
 #include "support/replies.h"
 #include "support/run_program.h"
 #include "support/sandbox.h"
@@ -96,17 +100,12 @@ void expect_not_sent(SystemLog *log, const Service &service, const std::string &
     EXPECT_EQ(std::to_string(service.pid()), line.pid);
 }
 
-rlim_t lowest_free_descriptor(pid_t pid) {
-    rlim_t fd = 0;
+unsigned lowest_free_descriptor(pid_t pid) {
+    unsigned fd = 0;
     while (
         std::filesystem::is_symlink("/proc/" + std::to_string(pid) + "/fd/" + std::to_string(fd)))
         ++fd;
     return fd;
-}
-
-void limit_descriptors(pid_t pid, rlim_t count) {
-    const rlimit limit = {count, 1024};
-    ASSERT_EQ(0, prlimit(pid, RLIMIT_NOFILE, &limit, nullptr));
 }
 
 std::string large_core() {
@@ -149,6 +148,18 @@ TEST(ServiceDumps, AClientThatAsksForACoreWithoutAProcessGetsTheNextCrash) {
         EXPECT_TRUE(download("core", core) == client.read_all());
         // One dump for one client.
         let_it_catch_up(service);
+        EXPECT_TRUE(service.is_at_rest());
+    });
+}
+
+TEST(ServiceDumps, ACrashIsTakenAlsoByAKernelWithoutAccept4) {
+    if (!can_refuse_calls())
+        GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
+    run_in_sandbox([] {
+        ServiceOptions options;
+        options.run.before_exec = [] { (void)refuse_call(SYS_accept4, ENOSYS); };
+        Service service(options);
+        Crash(service).expect_dismissal();
         EXPECT_TRUE(service.is_at_rest());
     });
 }
@@ -225,12 +236,12 @@ TEST(ServiceDumps, IfACrashCannotBeAcceptedTheClientGetsAnEmptyCore) {
         EXPECT_EQ(BAD_REQUEST, service.reply("/x", "cmd=pcap"));
         const int with_client = at_start + 1;
         EXPECT_TRUE(wait_until([&] { return service.descriptors() == with_client; }));
-        const rlim_t first_free = lowest_free_descriptor(service.pid());
-        limit_descriptors(service.pid(), first_free);
+        const unsigned first_free = lowest_free_descriptor(service.pid());
+        service.limit_descriptors(first_free);
         Crash crash(service);
         EXPECT_EQ(download("core", ""), client.read_all());
         // The crash is accepted as soon as that is possible, for nobody.
-        limit_descriptors(service.pid(), 1024);
+        service.limit_descriptors(1024);
         crash.expect_dismissal();
         EXPECT_EQ(BAD_REQUEST, service.reply("/x", "cmd=pcap"));
         EXPECT_TRUE(service.is_at_rest());

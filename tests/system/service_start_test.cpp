@@ -136,7 +136,7 @@ TEST(ServiceStart, SaysWhyItCannotDetach) {
 }
 
 #if !defined(__SANITIZE_THREAD__)  // whose run-time library has a thread of its own
-// No process or thread can be started any more.
+// No process or thread can be started any more, a sanitizer's search for leaks included.
 void refuse_clones() {
     (void)refuse_call(SYS_clone, EAGAIN);
     (void)refuse_call(SYS_clone3, EAGAIN);
@@ -147,7 +147,7 @@ TEST(ServiceStart, SaysWhyItCannotFork) {
         GTEST_SKIP() << "no system-call filters here: " << strerror(errno);
     TempDir dir;
     const RunResult result = run_fieldkit({"debugar.cgi", "-c", dir / "cgi", "-s", dir / "segf"},
-                                          {.before_exec = refuse_clones});
+                                          {.leak_check = false, .before_exec = refuse_clones});
     EXPECT_EQ(1, result.exit_status);
     EXPECT_EQ("daemon\n: Resource temporarily unavailable\n", result.err);
 }
@@ -158,7 +158,7 @@ TEST(ServiceStart, EndsWhenItCannotHaveItsMonitor) {
     TempDir dir;
     const RunResult result =
         run_fieldkit({"debugar.cgi", "-n", "-c", dir / "cgi", "-s", dir / "segf"},
-                     {.before_exec = refuse_clones});
+                     {.leak_check = false, .before_exec = refuse_clones});
     EXPECT_EQ(1, result.exit_status);
     EXPECT_EQ("pthread_create: Resource temporarily unavailable\n", result.err);
 }

@@ -51,11 +51,6 @@ std::string archive_begin(Service &service, const std::string &path, size_t size
     return begin.substr(0, size);
 }
 
-std::string body_of(const std::string &reply, const std::string &header) {
-    EXPECT_EQ(header, reply.substr(0, header.size()));
-    return reply.substr(std::min(header.size(), reply.size()));
-}
-
 void expect_whole_archive(const std::string &tar) {
     std::vector<TarMember> members = read_tar(tar);
     bool traced = false;
@@ -140,6 +135,7 @@ TEST(Service, ListsItselfAmongTheProcessesWithTheRealPs) {
         std::string reply = service.reply("/cgi/debug.cgi", "cmd=ps");
         body_of(reply, ok_header("text/plain", "psdump.txt"));
         EXPECT_NE(std::string::npos, reply.find("PID"));
+        EXPECT_NE(std::string::npos, reply.find("fieldkit")) << reply;
     });
 }
 
