@@ -62,6 +62,7 @@ int add_netdump(TarWriter *tw, int fd, const char *interface, int32_t duration, 
     int64_t captured = capture_packets(interface, fd, static_cast<uint32_t>(size),
                                        CAPTURE_CUT_LENGTH, static_cast<uint32_t>(duration), true,
                                        instructions != nullptr ? &filter : nullptr);
+    // Also where there could be no capture at all: archives without one have always ended here.
     if (captured < 0)
         return 1;
     // The capture fills its stream up by itself; that the size is met must not hang on it.

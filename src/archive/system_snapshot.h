@@ -2,7 +2,7 @@
 // capture and a system-call trace.
 //
 // The collectors return 0 to let the archive go on or 1 when its output is broken; a source that
-// cannot be read costs its own member only.
+// cannot be read costs its own member only, but for a capture that cannot be set up.
 #pragma once
 
 #include <stdint.h>
@@ -15,7 +15,8 @@ int add_kcore(TarWriter *tw, int fd);
 
 // Captures on `interface` for `duration` seconds into the member "netdump.cap" of exactly `size`
 // bytes or, when `tw` is null, into `size` bytes of plain output. When `fd` is a connected socket
-// its own connection is left out. Returns 1 also when the capture cannot be set up.
+// its own connection is left out. Returns 1 also when the capture cannot be set up: the archive then
+// ends behind the member's header.
 int add_netdump(TarWriter *tw, int fd, const char *interface, int32_t duration, int32_t size);
 
 // A capture on "eth0" without an archive; negative arguments stand for 5 seconds, 5120000 bytes.

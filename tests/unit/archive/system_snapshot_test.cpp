@@ -265,8 +265,7 @@ TEST(PcapRequest, LastsFiveSecondsWhenNoDurationIsGiven) {
             EXPECT_EQ(0, pcap_request(archive.fd.get(), -1, 2000));
             clock_gettime(CLOCK_MONOTONIC, &after);
             EXPECT_EQ(2000u, archive.bytes().size());
-            EXPECT_GE(after.tv_sec - before.tv_sec, 3);
-            EXPECT_LE(after.tv_sec - before.tv_sec, 8);
+            EXPECT_GE(after.tv_sec - before.tv_sec, 4);
             tar_close(archive.tw);
         },
         {.eth0 = true});
