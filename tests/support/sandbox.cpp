@@ -13,6 +13,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <exception>
 #include <filesystem>
 #include <set>
 #include <utility>
@@ -79,7 +80,12 @@ void set_up(const SandboxOptions &options) {
 
 [[noreturn]] void run_body(const std::function<void()> &body, const SandboxOptions &options) {
     set_up(options);
-    body();
+    // Caught by the framework it would have this process go on with the tests that follow.
+    try {
+        body();
+    } catch (const std::exception &e) {
+        ADD_FAILURE() << e.what();
+    }
     fflush(stdout);
     fflush(stderr);
     _exit(testing::Test::IsSkipped() ? SKIPPED : testing::Test::HasFailure() ? 1 : 0);
