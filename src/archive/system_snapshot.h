@@ -15,8 +15,8 @@ int add_kcore(TarWriter *tw, int fd);
 
 // Captures on `interface` for `duration` seconds into the member "netdump.cap" of exactly `size`
 // bytes or, when `tw` is null, into `size` bytes of plain output. When `fd` is a connected socket
-// its own connection is left out. Returns 1 also when the capture cannot be set up: the archive then
-// ends behind the member's header.
+// its own connection is left out. Returns 1 also when the capture cannot be set up: the archive
+// then ends behind the member's header.
 int add_netdump(TarWriter *tw, int fd, const char *interface, int32_t duration, int32_t size);
 
 // A capture on "eth0" without an archive; negative arguments stand for 5 seconds, 5120000 bytes.
