@@ -28,9 +28,8 @@ void tar_close(TarWriter *tw);
 void tar_abandon(TarWriter *tw);
 
 // Pads the previous member and writes the header of member `name` with `size` bytes of data, from 0
-// to TAR_SIZE_LIMIT. A name
-// that does not fit the header's 100 bytes together with the prefix is cut. Write errors are not
-// told; they show in the data that follows.
+// to TAR_SIZE_LIMIT. A name that does not fit the header's 100 bytes together with the prefix is
+// cut. Write errors are not told; they show in the data that follows.
 void tar_header(TarWriter *tw, const char *name, int64_t size);
 
 // Writes data of the current member. Returns what write_all returns.
