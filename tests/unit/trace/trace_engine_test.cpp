@@ -430,13 +430,16 @@ struct OwnTrace {
 
 uint32_t watch_for_overlap(intptr_t cookie, const char *, uint32_t len) {
     OwnTrace *own = reinterpret_cast<OwnTrace *>(cookie);
-    if (len == 0 && !own->active)
-        return 1;  // it may still have to wait
-    if (!own->active && traces_active.fetch_add(1) != 0)
-        overlapped = true;
-    own->active = true;
-    // Long enough for the other one to begin as well, if it could.
-    if (traces_called < 2 || --own->lines_left > 0)
+    if (len != 0) {
+        if (!own->active && traces_active.fetch_add(1) != 0)
+            overlapped = true;
+        own->active = true;
+        --own->lines_left;
+        return 1;
+    }
+    // Asked whether to go on: yes while it may still have to wait, and then for long enough for the
+    // other one to begin as well, if it could.
+    if (!own->active || traces_called < 2 || own->lines_left > 0)
         return 1;
     traces_active.fetch_sub(1);
     return 0;
