@@ -5,7 +5,6 @@
 #include <poll.h>
 
 #include <array>
-#include <memory>
 #include <string>
 
 #include "support/packets.h"
